@@ -1,0 +1,60 @@
+#pragma once
+// "SIM1": the UICC in the modem presented as a secure element. Each call picks
+// the modem that carries the SIM the NFC side is switched to and turns into
+// one request for that modem's worker.
+#include <pthread.h>
+
+#include <android/hardware/secure_element/1.0/ISecureElement.h>
+#include <hidl/HidlSupport.h>
+
+namespace android {
+namespace hardware {
+namespace secure_element {
+namespace V1_0 {
+namespace implementation {
+
+using ::android::sp;
+using ::android::wp;
+using ::android::hardware::hidl_death_recipient;
+using ::android::hardware::hidl_vec;
+using ::android::hardware::Return;
+using ::android::hidl::base::V1_0::IBase;
+
+// The SIM front's lock: one normal (non-recursive) mutex, built before main.
+class ZerbThreadMutex {
+ public:
+  ZerbThreadMutex();
+  virtual ~ZerbThreadMutex();
+  pthread_mutex_t* get() { return &m_mutex; }
+
+ private:
+  pthread_mutex_t m_mutex;
+};
+
+struct ZerbSimSecureElement : public ISecureElement, public hidl_death_recipient {
+  explicit ZerbSimSecureElement(int modemId);
+  ~ZerbSimSecureElement() override;
+
+  Return<void> init(const sp<ISecureElementHalCallback>& clientCallback) override;
+  Return<void> getAtr(getAtr_cb _hidl_cb) override;
+  Return<bool> isCardPresent() override;
+  Return<void> transmit(const hidl_vec<uint8_t>& data, transmit_cb _hidl_cb) override;
+  Return<void> openLogicalChannel(const hidl_vec<uint8_t>& aid, uint8_t p2,
+                                  openLogicalChannel_cb _hidl_cb) override;
+  Return<void> openBasicChannel(const hidl_vec<uint8_t>& aid, uint8_t p2,
+                                openBasicChannel_cb _hidl_cb) override;
+  Return<SecureElementStatus> closeChannel(uint8_t channelNumber) override;
+
+  void serviceDied(uint64_t cookie, const wp<IBase>& who) override;
+
+  int modemId() const { return m_modem_id; }
+
+ private:
+  int32_t m_modem_id;
+};
+
+}  // namespace implementation
+}  // namespace V1_0
+}  // namespace secure_element
+}  // namespace hardware
+}  // namespace android
