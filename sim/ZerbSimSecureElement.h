@@ -18,6 +18,7 @@ using ::android::wp;
 using ::android::hardware::hidl_death_recipient;
 using ::android::hardware::hidl_vec;
 using ::android::hardware::Return;
+using ::android::hardware::Void;
 using ::android::hidl::base::V1_0::IBase;
 
 // The SIM front's lock: one normal (non-recursive) mutex, built before main.
