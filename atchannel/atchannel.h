@@ -4,6 +4,8 @@
 // of the calling thread.
 #include <cstdint>
 
+#include "se_modem_id.h"  // g_ulModemId, defined in se_common; printed in log lines only
+
 struct ATResponseLine {
   ATResponseLine* next;  // owned; null at the end
   char* text;            // owned heap copy of the line
