@@ -1,6 +1,16 @@
 #include "ZerbSimSecureElement.h"
 
 #include <log/log.h>
+#include <securec.h>
+#include <sys/sysinfo.h>
+
+#include "async_cmd.h"
+#include "modem_select.h"
+#include "se_delay.h"
+#include "se_modem_id.h"
+
+uint8_t g_simOpenedChannels[SIM_CHANNEL_MAX];
+std::atomic<int32_t> timeflag{-1};
 
 namespace android {
 namespace hardware {
@@ -10,7 +20,10 @@ namespace implementation {
 
 namespace {
 constexpr const char* kTag = "ZerbSimSecureElement";
-}
+// Settling time the modem needs after boot before the first request.
+constexpr uint64_t kSettleMicros = 1500000;
+constexpr long kSettledUptimeSeconds = 120;
+}  // namespace
 
 #define SIM_LOGD(...) __android_log_buf_print(LOG_ID_RADIO, ANDROID_LOG_DEBUG, kTag, __VA_ARGS__)
 #define SIM_LOGE(...) __android_log_buf_print(LOG_ID_RADIO, ANDROID_LOG_ERROR, kTag, __VA_ARGS__)
@@ -27,6 +40,44 @@ ZerbThreadMutex::~ZerbThreadMutex() { pthread_mutex_destroy(&m_mutex); }
 // The SIM front's lock, built before main.
 static ZerbThreadMutex g_simMutex;
 
+namespace {
+
+// Holds g_simMutex for one scope.
+class SimLock {
+ public:
+  SimLock() { pthread_mutex_lock(g_simMutex.get()); }
+  ~SimLock() { pthread_mutex_unlock(g_simMutex.get()); }
+  SimLock(const SimLock&) = delete;
+  SimLock& operator=(const SimLock&) = delete;
+};
+
+hidl_vec<uint8_t> bytesOf(const uint8_t* data, int32_t count) {
+  hidl_vec<uint8_t> out;
+  out.resize(static_cast<size_t>(count));
+  (void)memcpy_s(out.data(), out.size(), data, static_cast<size_t>(count));
+  return out;
+}
+
+void settleAfterBoot() {
+  if (timeflag == 1) return;
+  struct sysinfo info;
+  if (sysinfo(&info) != 0) {
+    SIM_LOGD("Failed to get sysinfo\n");
+    se_delay::sleepMicros(kSettleMicros);
+    SIM_LOGD("%s, SLEEP 1.5S", "init");
+    return;
+  }
+  SIM_LOGD("%s, time is %ld", "print_system_boot_time", static_cast<long>(info.uptime));
+  if (info.uptime >= kSettledUptimeSeconds) {
+    timeflag = 1;
+    return;
+  }
+  se_delay::sleepMicros(kSettleMicros);
+  SIM_LOGD("%s, SLEEP 1.5S", "init");
+}
+
+}  // namespace
+
 ZerbSimSecureElement::ZerbSimSecureElement(int modemId) {
   SIM_LOGD("%s, modemid %d", "ZerbSimSecureElement", modemId);
   m_modem_id = (modemId == 0 || modemId == 1) ? modemId : 0;
@@ -34,28 +85,120 @@ ZerbSimSecureElement::ZerbSimSecureElement(int modemId) {
 
 ZerbSimSecureElement::~ZerbSimSecureElement() {}
 
-// Until the modem side exists, the front answers as one whose modem is not up.
+// Picks the modem for this call and makes it current. Called under g_simMutex.
+void ZerbSimSecureElement::selectModem(const char* operation) {
+  m_modem_id = communication_which_modem();
+  if (m_modem_id < 0) {
+    SIM_LOGE("%s, modem_id error: %d", operation, m_modem_id);
+    m_modem_id = 0;
+  }
+  SIM_LOGD("%s, modem_id: %d", operation, m_modem_id);
+  g_ulModemId = m_modem_id;
+}
+
 Return<void> ZerbSimSecureElement::init(const sp<ISecureElementHalCallback>& clientCallback) {
-  (void)clientCallback;
+  SIM_LOGD("%s, m_modem_id: %d", "init", m_modem_id);
+  g_ulModemId = m_modem_id;
+  if (clientCallback == nullptr) {
+    SIM_LOGE("%s, clientCallback is NULL", "init");
+    return Void();
+  }
+  (void)clientCallback->linkToDeath(this, 0);
+
+  // Channels 1 and 2 are left alone: the sweep starts at 3.
+  for (uint8_t channel = 3; channel < SIM_CHANNEL_MAX; channel++) {
+    bool opened;
+    {
+      SimLock lock;
+      opened = g_simOpenedChannels[channel] != 0;
+    }
+    if (opened) (void)closeChannel(channel);
+  }
+
+  int32_t dualSim = judge_dual_sim();
+  SIM_LOGD("%s, dual_sim = %d", "init", dualSim);
+  g_ulModemId = 0;
+  int32_t ret0 = init_at_channel(0);
+  int32_t ret1 = 0;
+  if (dualSim == 2) {
+    SIM_LOGD("%s, dual_sim init second pthread", "init");
+    g_ulModemId = 1;
+    ret1 = init_at_channel(1);
+  }
+  if (ret0 != 0 || ret1 != 0) {
+    SIM_LOGE("%s, init_at_channel FAIL", "init");
+    return Void();
+  }
+  SIM_LOGD("%s, m%d init_at_channel SUCCESS", "init", g_ulModemId);
+
+  settleAfterBoot();
+  (void)clientCallback->onStateChange(true);
   return Void();
 }
 
 Return<void> ZerbSimSecureElement::getAtr(getAtr_cb _hidl_cb) {
-  _hidl_cb(hidl_vec<uint8_t>());
+  SimLock lock;
+  selectModem("getAtr");
+  hidl_vec<uint8_t> atr;
+  if (asyncCmdPush(m_modem_id, REQUEST_GET_ATR, nullptr, 0) == 0) {
+    SIM_LOGD("%s, now copy data, modem_id: %d", "getAtr", m_modem_id);
+    if (g_asyncCmd.datalen >= 1 && g_asyncCmd.datalen <= ASYNC_CMD_DATA_MAX) atr = bytesOf(g_asyncCmd.data, g_asyncCmd.datalen);
+  }
+  _hidl_cb(atr);
   return Void();
 }
 
-Return<bool> ZerbSimSecureElement::isCardPresent() { return false; }
+Return<bool> ZerbSimSecureElement::isCardPresent() {
+  SimLock lock;
+  selectModem("isCardPresent");
+  bool present = false;
+  if (asyncCmdPush(m_modem_id, REQUEST_GET_CARD_PRESENT, nullptr, 0) == 0) {
+    present = g_asyncCmd.param > 0;
+  }
+  return present;
+}
 
-Return<void> ZerbSimSecureElement::transmit(const hidl_vec<uint8_t>&, transmit_cb _hidl_cb) {
-  _hidl_cb(hidl_vec<uint8_t>());
+Return<void> ZerbSimSecureElement::transmit(const hidl_vec<uint8_t>& data, transmit_cb _hidl_cb) {
+  SimLock lock;
+  selectModem("transmit");
+  hidl_vec<uint8_t> response;
+  // Sizes beyond int32 are refused by the push as an invalid length.
+  int32_t len = data.size() > static_cast<size_t>(INT32_MAX) ? -1 : static_cast<int32_t>(data.size());
+  if (asyncCmdPush(m_modem_id, REQUEST_TRANSMIT_APDU, data.data(), len) == 0) {
+    SIM_LOGD("%s, now copy data, modem_id: %d", "transmit", m_modem_id);
+    if (g_asyncCmd.param == 0 && g_asyncCmd.datalen >= 1 &&
+        g_asyncCmd.datalen <= ASYNC_CMD_DATA_MAX) {
+      response = bytesOf(g_asyncCmd.data, g_asyncCmd.datalen);
+    }
+  }
+  _hidl_cb(response);
   return Void();
 }
 
-Return<void> ZerbSimSecureElement::openLogicalChannel(const hidl_vec<uint8_t>&, uint8_t,
+Return<void> ZerbSimSecureElement::openLogicalChannel(const hidl_vec<uint8_t>& aid, uint8_t p2,
                                                       openLogicalChannel_cb _hidl_cb) {
+  SimLock lock;
+  selectModem("openLogicalChannel");
   LogicalChannelResponse response;
-  _hidl_cb(response, SecureElementStatus::FAILED);
+  SecureElementStatus status = SecureElementStatus::FAILED;
+  g_asyncCmd.param = static_cast<int32_t>(p2);
+  int32_t len = aid.size() > static_cast<size_t>(INT32_MAX) ? -1 : static_cast<int32_t>(aid.size());
+  if (asyncCmdPush(m_modem_id, REQUEST_OPEN_LOGICAL_CHANNEL, aid.data(), len) == 0) {
+    SIM_LOGD("%s, now copy data, modem_id: %d", "openLogicalChannel", m_modem_id);
+    uint8_t code = static_cast<uint8_t>(g_asyncCmd.param & 0xFF);
+    if (code != 0) {
+      status = static_cast<SecureElementStatus>(code);
+    } else {
+      uint8_t channel = g_asyncCmd.data[0];
+      if (channel < SIM_CHANNEL_MAX) g_simOpenedChannels[channel] = 1;
+      response.channelNumber = channel;
+      if (g_asyncCmd.datalen >= 1 && g_asyncCmd.datalen <= ASYNC_CMD_SELECT_RESP_MAX) {
+        response.selectResponse = bytesOf(g_asyncCmd.data + 1, g_asyncCmd.datalen);
+      }
+      status = SecureElementStatus::SUCCESS;
+    }
+  }
+  _hidl_cb(response, status);
   return Void();
 }
 
@@ -66,8 +209,16 @@ Return<void> ZerbSimSecureElement::openBasicChannel(const hidl_vec<uint8_t>&, ui
   return Void();
 }
 
-Return<SecureElementStatus> ZerbSimSecureElement::closeChannel(uint8_t) {
-  return SecureElementStatus::FAILED;
+Return<SecureElementStatus> ZerbSimSecureElement::closeChannel(uint8_t channelNumber) {
+  SimLock lock;
+  selectModem("closeChannel");
+  SecureElementStatus status = SecureElementStatus::FAILED;
+  g_asyncCmd.param = static_cast<int32_t>(channelNumber);
+  if (asyncCmdPush(m_modem_id, REQUEST_CLOSE_LOGICAL_CHANNEL, nullptr, 0) == 0) {
+    status = static_cast<SecureElementStatus>(g_asyncCmd.param & 0xFF);
+  }
+  if (channelNumber < SIM_CHANNEL_MAX) g_simOpenedChannels[channelNumber] = 0;
+  return status;
 }
 
 void ZerbSimSecureElement::serviceDied(uint64_t, const wp<IBase>&) {

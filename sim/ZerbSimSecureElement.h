@@ -4,8 +4,18 @@
 // one request for that modem's worker.
 #include <pthread.h>
 
+#include <atomic>
+#include <cstdint>
+
 #include <android/hardware/secure_element/1.0/ISecureElement.h>
 #include <hidl/HidlSupport.h>
+
+// Logical channels 0 to 19 opened through the SIM front and not closed
+// through it; guarded by the front's lock.
+#define SIM_CHANNEL_MAX 20
+extern uint8_t g_simOpenedChannels[SIM_CHANNEL_MAX];
+// 1 once an init found the system up for 120 s or more; -1 before.
+extern std::atomic<int32_t> timeflag;
 
 namespace android {
 namespace hardware {
@@ -51,6 +61,8 @@ struct ZerbSimSecureElement : public ISecureElement, public hidl_death_recipient
   int modemId() const { return m_modem_id; }
 
  private:
+  void selectModem(const char* operation);
+
   int32_t m_modem_id;
 };
 
