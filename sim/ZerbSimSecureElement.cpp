@@ -129,7 +129,7 @@ Return<void> ZerbSimSecureElement::init(const sp<ISecureElementHalCallback>& cli
     SIM_LOGE("%s, init_at_channel FAIL", "init");
     return Void();
   }
-  SIM_LOGD("%s, m%d init_at_channel SUCCESS", "init", g_ulModemId);
+  SIM_LOGD("%s, m%d init_at_channel SUCCESS", "init", static_cast<int32_t>(g_ulModemId));
 
   settleAfterBoot();
   (void)clientCallback->onStateChange(true);

@@ -153,7 +153,7 @@ void adjust_session(void) {
 
 void request_get_card_present(void) {
   static const char* const kFn = "request_get_card_present";
-  QV_LOGD("%s, enter, g_ulModemId: %d", kFn, g_ulModemId);
+  QV_LOGD("%s, enter, g_ulModemId: %d", kFn, static_cast<int32_t>(g_ulModemId));
   int32_t present = 0;
   ResponseHolder response;
   int32_t err = at_send_command_singleline("AT^CARDTYPE?", "^CARDTYPE:", response.out());
@@ -182,7 +182,7 @@ void request_get_card_present(void) {
 
 void request_get_atr(void) {
   static const char* const kFn = "request_get_atr";
-  QV_LOGD("%s, enter, g_ulModemId: %d", kFn, g_ulModemId);
+  QV_LOGD("%s, enter, g_ulModemId: %d", kFn, static_cast<int32_t>(g_ulModemId));
   ResponseHolder response;
   const char* cardatr = nullptr;
   int32_t err = at_send_command_singleline("AT^CARDATR", "^CARDATR:", response.out());
@@ -222,7 +222,7 @@ void request_open_logical_channel(void) {
   static const char* const kFn = "request_open_logical_channel";
   const int32_t p2 = g_asyncCmd.param;
   const int32_t aidLen = g_asyncCmd.datalen;
-  QV_LOGD("%s, enter, g_ulModemId: %d, p2: %d", kFn, g_ulModemId, p2);
+  QV_LOGD("%s, enter, g_ulModemId: %d, p2: %d", kFn, static_cast<int32_t>(g_ulModemId), p2);
   if (aidLen < 1) {
     QV_LOGE("%s, aid size: %d error", kFn, aidLen);
     g_asyncCmd.param = 1;
@@ -308,7 +308,7 @@ void request_open_logical_channel(void) {
 
 void request_close_logical_channel(void) {
   static const char* const kFn = "request_close_logical_channel";
-  QV_LOGD("%s, enter, g_ulModemId: %d", kFn, g_ulModemId);
+  QV_LOGD("%s, enter, g_ulModemId: %d", kFn, static_cast<int32_t>(g_ulModemId));
   int32_t channel = g_asyncCmd.param;
   if (channel < 1 || channel >= SESSION_TABLE_SIZE) {
     QV_LOGE("%s, channel %d is invalid", kFn, channel);
@@ -347,7 +347,7 @@ void request_close_logical_channel(void) {
 
 void request_transmit_apdu(void) {
   static const char* const kFn = "request_transmit_apdu";
-  QV_LOGD("%s, enter, g_ulModemId: %d", kFn, g_ulModemId);
+  QV_LOGD("%s, enter, g_ulModemId: %d", kFn, static_cast<int32_t>(g_ulModemId));
   g_asyncCmd.param = 1;
   const int32_t apduLen = g_asyncCmd.datalen;
   if (apduLen <= 3 || apduLen > ASYNC_CMD_DATA_MAX) {
@@ -356,7 +356,7 @@ void request_transmit_apdu(void) {
   }
   const uint8_t cla = g_asyncCmd.data[0];
   const int32_t channel = (cla & 0x40) ? (cla & 0x0F) + 4 : (cla & 0x03);
-  QV_LOGD("m%d %s, cla: 0x%02X, logic channel: %d", g_ulModemId, kFn, cla, channel);
+  QV_LOGD("m%d %s, cla: 0x%02X, logic channel: %d", static_cast<int32_t>(g_ulModemId), kFn, cla, channel);
   adjust_session();
 
   char cmd[kTransmitCmdSize];

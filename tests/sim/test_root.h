@@ -1,0 +1,63 @@
+#pragma once
+// A fresh device root per test: a temporary folder that SE_DEVICE_ROOT
+// points at, removed again at the end.
+#include <stdlib.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <fstream>
+#include <string>
+
+namespace sim_test {
+
+class TestRoot {
+ public:
+  TestRoot() {
+    char tmpl[] = "/tmp/simtest.XXXXXX";
+    const char* dir = mkdtemp(tmpl);
+    path_ = dir ? dir : "";
+    setenv("SE_DEVICE_ROOT", path_.c_str(), 1);
+    makeDir("dev");
+    makeDir("sys/nfc");
+  }
+  ~TestRoot() {
+    if (!path_.empty()) {
+      std::string cmd = "rm -rf '" + path_ + "'";
+      int rc = system(cmd.c_str());
+      (void)rc;
+    }
+  }
+  TestRoot(const TestRoot&) = delete;
+  TestRoot& operator=(const TestRoot&) = delete;
+
+  const std::string& path() const { return path_; }
+  std::string at(const std::string& rel) const { return path_ + "/" + rel; }
+
+  void makeDir(const std::string& rel) {
+    std::string p = path_;
+    size_t pos = 0;
+    while (pos != std::string::npos) {
+      pos = rel.find('/', pos + 1);
+      mkdir((p + "/" + rel.substr(0, pos)).c_str(), 0755);
+    }
+  }
+  void writeFile(const std::string& rel, const std::string& content) {
+    std::ofstream(at(rel), std::ios::trunc) << content;
+  }
+  void appendFile(const std::string& rel, const std::string& content) {
+    std::ofstream(at(rel), std::ios::app) << content;
+  }
+  // nullptr removes the node.
+  void writeNode(const std::string& rel, const char* content) {
+    if (content == nullptr) {
+      unlink(at(rel).c_str());
+    } else {
+      writeFile(rel, content);
+    }
+  }
+
+ private:
+  std::string path_;
+};
+
+}  // namespace sim_test
