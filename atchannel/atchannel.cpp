@@ -1,0 +1,706 @@
+// The AT command channel: one context per modem port, a reader thread that
+// sorts the port's lines, and a sender that writes one command at a time
+// and waits for its final response.
+#include "atchannel.h"
+
+#include <android/log.h>
+#include <errno.h>
+#include <poll.h>
+#include <securec.h>
+#include <sys/eventfd.h>
+#include <unistd.h>
+
+#include <cstdlib>
+#include <cstring>
+#include <ctime>
+#include <memory>
+#include <new>
+
+#include "at_line.h"
+#include "at_tok.h"
+#include "atchannel_internal.h"
+#include "se_delay.h"
+
+namespace {
+
+const char* const kTag = "atchannel";
+
+#define AT_LOGD(...) __android_log_buf_print(LOG_ID_RADIO, ANDROID_LOG_DEBUG, kTag, __VA_ARGS__)
+#define AT_LOGI(...) __android_log_buf_print(LOG_ID_RADIO, ANDROID_LOG_INFO, kTag, __VA_ARGS__)
+#define AT_LOGE(...) __android_log_buf_print(LOG_ID_RADIO, ANDROID_LOG_ERROR, kTag, __VA_ARGS__)
+
+constexpr uint64_t kCommandTimeoutMicros = 600ULL * 1000000ULL;
+constexpr uint64_t kWriteRetryMicros = 1000000ULL;
+// Pause after a zero-byte read before the port is read again.
+constexpr uint64_t kEofRetryMicros = 1000000ULL;
+constexpr int32_t kWriteAttempts = 5;
+constexpr int32_t kModemSlots = 2;
+
+pthread_key_t ac_key;
+pthread_once_t ac_key_once = PTHREAD_ONCE_INIT;
+bool g_keyMade = false;  // written only inside the once-control
+
+pthread_attr_t reader_thread_attrs[kModemSlots];
+bool g_attrInited[kModemSlots];
+pthread_mutex_t g_attrLock = PTHREAD_MUTEX_INITIALIZER;
+
+// The context this thread reads for, when it is a reader thread.
+thread_local AtContext* t_readerOf = nullptr;
+// True while the reader runs the unsolicited handler with command_lock held.
+thread_local bool t_inLockedHandler = false;
+
+class MutexGuard {
+ public:
+  explicit MutexGuard(pthread_mutex_t* m, bool take = true) : m_(take ? m : nullptr) {
+    if (m_ != nullptr) pthread_mutex_lock(m_);
+  }
+  ~MutexGuard() {
+    if (m_ != nullptr) pthread_mutex_unlock(m_);
+  }
+  MutexGuard(const MutexGuard&) = delete;
+  MutexGuard& operator=(const MutexGuard&) = delete;
+
+ private:
+  pthread_mutex_t* m_;
+};
+
+struct FreeDeleter {
+  void operator()(void* p) const { free(p); }
+};
+using CharBuf = std::unique_ptr<char, FreeDeleter>;
+
+const char* errText(int err, char* buf, size_t len) {
+  // GNU strerror_r may return a static text instead of filling buf.
+  return strerror_r(err, buf, len);
+}
+
+void make_key() { g_keyMade = pthread_key_create(&ac_key, nullptr) == 0; }
+
+bool keyReady() { return pthread_once(&ac_key_once, make_key) == 0 && g_keyMade; }
+
+AtContext* getAtContext() {
+  AtContext* ac = nullptr;
+  if (keyReady()) ac = static_cast<AtContext*>(pthread_getspecific(ac_key));
+  if (ac == nullptr) AT_LOGE("%s, m%d ac is NULL", "getAtContext", g_ulModemId);
+  return ac;
+}
+
+int32_t currentFd(AtContext* ac) {
+  MutexGuard g(&ac->port_lock);
+  return ac->fd;
+}
+
+void destroyContextSync(AtContext* ac) {
+  pthread_cond_destroy(&ac->reader_gone_cond);
+  pthread_mutex_destroy(&ac->port_lock);
+  pthread_cond_destroy(&ac->command_cond);
+  pthread_condattr_destroy(&ac->command_cond_attr);
+  pthread_cond_destroy(&ac->request_cond);
+  pthread_mutex_destroy(&ac->request_lock);
+  pthread_mutex_destroy(&ac->command_lock);
+}
+
+// Creates and binds the calling thread's context, or finds the one it has.
+AtContext* InitializeAtContext(int32_t fd, int32_t index) {
+  if (!keyReady()) {
+    AT_LOGE("[m%d][ch:%d] pthread_once failed!", index, fd);
+    AT_LOGE("m%d_%d>InitializeAtContext failed!", index, fd);
+    return nullptr;
+  }
+  if (pthread_getspecific(ac_key) != nullptr) {
+    AT_LOGD("[m%d][ch:%d] ac is not null", index, fd);
+  } else {
+    AT_LOGD("[m%d][ch:%d] ac is null, will malloc", index, fd);
+    std::unique_ptr<AtContext> fresh(new (std::nothrow) AtContext());
+    if (!fresh) {
+      AT_LOGE("malloc atcontext failed\n");
+      AT_LOGE("m%d_%d>InitializeAtContext failed!", index, fd);
+      return nullptr;
+    }
+    AtContext* ac = fresh.get();
+    ac->index = index;
+    ac->fd = -1;  // at_open sets the port once any earlier reader is gone
+    at_line_reset(ac->line_buf, &ac->line_cur, &ac->read_end);
+    pthread_mutex_init(&ac->command_lock, nullptr);
+    pthread_mutex_init(&ac->request_lock, nullptr);
+    pthread_cond_init(&ac->request_cond, nullptr);
+    pthread_condattr_init(&ac->command_cond_attr);
+    pthread_condattr_setclock(&ac->command_cond_attr, CLOCK_MONOTONIC);
+    pthread_cond_init(&ac->command_cond, &ac->command_cond_attr);
+    pthread_mutex_init(&ac->port_lock, nullptr);
+    pthread_cond_init(&ac->reader_gone_cond, nullptr);
+    ac->wake_fd = eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK);
+    if (ac->wake_fd < 0) {
+      destroyContextSync(ac);
+      AT_LOGE("m%d_%d>InitializeAtContext failed!", index, fd);
+      return nullptr;
+    }
+    if (pthread_setspecific(ac_key, ac) != 0) {
+      AT_LOGE("[m%d][ch:%d] pthread_setspecific failed!", index, fd);
+      close(ac->wake_fd);
+      destroyContextSync(ac);
+      AT_LOGE("m%d_%d>InitializeAtContext failed!", index, fd);
+      return nullptr;
+    }
+    // Bound to the thread from now on; the record lives until the process
+    // ends, since a detached reader may still hold it after at_close.
+    (void)fresh.release();
+  }
+  AtContext* ac = getAtContext();
+  if (ac == nullptr) AT_LOGE("getAtContext return null pointer!");
+  return ac;
+}
+
+void wakeReader(AtContext* ac) {
+  uint64_t one = 1;
+  ssize_t n = write(ac->wake_fd, &one, sizeof(one));
+  (void)n;  // a full counter still wakes the reader
+}
+
+void drainWake(AtContext* ac) {
+  uint64_t count = 0;
+  ssize_t n = read(ac->wake_fd, &count, sizeof(count));
+  (void)n;
+}
+
+// Marks the channel closed, closes the port and wakes the reader. The port
+// is closed with command_lock and port_lock held: a sender writes only under
+// command_lock after checking reader_closed, the reader reads only under
+// port_lock after checking fd, so neither touches a number reused since.
+void closePort(AtContext* ac, bool commandLockHeld) {
+  int32_t failedFd = -1;
+  {
+    MutexGuard command(&ac->command_lock, !commandLockHeld);
+    if (ac->reader_closed == 0) {
+      ac->reader_closed = 1;
+      pthread_cond_signal(&ac->command_cond);
+    }
+    MutexGuard port(&ac->port_lock);
+    if (ac->fd >= 0 && close(ac->fd) != 0) failedFd = ac->fd;
+    ac->fd = -1;
+  }
+  wakeReader(ac);
+  if (failedFd >= 0) {
+    AT_LOGE("m%d_%d>failed to close fd %d!", g_ulModemId, ac->index, failedFd);
+  }
+}
+
+// A reused context gets a new reader only after the previous one has left
+// the record, so that two readers never share the input buffer.
+void retirePreviousReader(AtContext* ac) {
+  bool running;
+  {
+    MutexGuard g(&ac->port_lock);
+    running = ac->reader_running != 0;
+  }
+  if (running || currentFd(ac) >= 0) closePort(ac, false);
+  MutexGuard g(&ac->port_lock);
+  while (ac->reader_running != 0) pthread_cond_wait(&ac->reader_gone_cond, &ac->port_lock);
+}
+
+void* readerMain(void* arg) { return readerLoop(static_cast<AtContext*>(arg)); }
+
+void readerGone(AtContext* ac) {
+  {
+    MutexGuard g(&ac->command_lock);
+    if (ac->reader_closed == 0) {
+      ac->reader_closed = 1;
+      pthread_cond_signal(&ac->command_cond);
+    }
+  }
+  AT_LOGI("[m%d][ch:%d] < reader close.\n", ac->index, currentFd(ac));
+  MutexGuard g(&ac->port_lock);
+  ac->reader_running = 0;
+  pthread_cond_broadcast(&ac->reader_gone_cond);
+  // The record must not be touched after this point: a new at_open may
+  // already be reusing it.
+}
+
+void handleUnsolicited(AtContext* ac, const char* line, bool lockHeld) {
+  if (ac->unsol_handler == nullptr) return;
+  t_inLockedHandler = lockHeld;
+  ac->unsol_handler(line, nullptr);
+  t_inLockedHandler = false;
+}
+
+// Sorts one line; command_lock is held.
+void processLine(AtContext* ac, const char* line) {
+  ATResponse* r = ac->response;
+  // Once the final response is in, the command takes no more lines, even if
+  // its sender has not woken yet.
+  int32_t pending = (r != nullptr && r->final_response == nullptr) ? 1 : 0;
+  AtLineKind kind = at_classify_line(line, pending, ac->command_type,
+                                     (pending && r->p_intermediates != nullptr) ? 1 : 0,
+                                     ac->response_prefix);
+  switch (kind) {
+    case AT_KIND_FINAL_SUCCESS:
+    case AT_KIND_FINAL_ERROR:
+      r->success = kind == AT_KIND_FINAL_SUCCESS ? 1 : 0;
+      r->final_response = strdup(line);
+      pthread_cond_signal(&ac->command_cond);
+      break;
+    case AT_KIND_INTERMEDIATE: {
+      auto* node = static_cast<ATResponseLine*>(calloc(1, sizeof(ATResponseLine)));
+      char* text = strdup(line);
+      if (node == nullptr || text == nullptr) {
+        free(node);
+        free(text);
+        break;
+      }
+      node->text = text;
+      node->next = r->p_intermediates;
+      r->p_intermediates = node;
+      break;
+    }
+    case AT_KIND_UNSOLICITED:
+      handleUnsolicited(ac, line, true);
+      break;
+  }
+}
+
+int32_t readPort(void* arg, char* dest, int32_t max_len) {
+  auto* ac = static_cast<AtContext*>(arg);
+  int32_t n = sync_read(currentFd(ac), dest, max_len);
+  if (n > 0) ac->eof_count = 0;
+  return n;
+}
+
+void waitForWake(AtContext* ac, uint64_t micros) {
+  struct pollfd pfd = {ac->wake_fd, POLLIN, 0};
+  uint64_t ms = micros / 1000;
+  int timeout = ms == 0 ? 1 : (ms > 60000 ? 60000 : static_cast<int>(ms));
+  int rc = poll(&pfd, 1, timeout);
+  (void)rc;  // the caller reads again either way
+}
+
+struct timespec deadlineAfter(uint64_t micros) {
+  struct timespec now;
+  clock_gettime(CLOCK_MONOTONIC, &now);
+  uint64_t nsec = static_cast<uint64_t>(now.tv_nsec) + (micros % 1000000ULL) * 1000ULL;
+  struct timespec t;
+  t.tv_sec = now.tv_sec + static_cast<time_t>(micros / 1000000ULL) +
+             static_cast<time_t>(nsec / 1000000000ULL);
+  t.tv_nsec = static_cast<long>(nsec % 1000000000ULL);
+  return t;
+}
+
+void reverseIntermediates(ATResponse* r) {
+  ATResponseLine* prev = nullptr;
+  ATResponseLine* cur = r->p_intermediates;
+  while (cur != nullptr) {
+    ATResponseLine* next = cur->next;
+    cur->next = prev;
+    prev = cur;
+    cur = next;
+  }
+  r->p_intermediates = prev;
+}
+
+// One write attempt: 0 written, -3 channel closed, -1 failed.
+int32_t writeAttempt(const char* s, size_t len) {
+  AtContext* ac = getAtContext();
+  if (ac == nullptr) {
+    AT_LOGE("getAtContext return null pointer!");
+    return -1;
+  }
+  if (ac->fd < 0 || ac->reader_closed > 0) {
+    AT_LOGE("writeline error,errno:%d", -3);
+    return -3;
+  }
+  const char* word = at_mask_find(s);
+  if (word != nullptr) {
+    AT_LOGI("m%d_%d>AT+%s=***\n", ac->index, ac->fd, word);
+  } else {
+    AT_LOGI("m%d_%d>%s\n", ac->index, ac->fd, s);
+  }
+  size_t size = len + 2;
+  CharBuf buf(static_cast<char*>(calloc(size, 1)));
+  if (!buf) {
+    AT_LOGD("malloc tmp failed\n");
+    return -1;
+  }
+  if (snprintf_s(buf.get(), size, size - 1, "%s\r", s) != static_cast<int>(len + 1)) return -1;
+  size_t done = 0;
+  while (done < len + 1) {
+    ssize_t n = write(ac->fd, buf.get() + done, len + 1 - done);
+    if (n < 0 && errno == EINTR) continue;
+    if (n <= 0) return -1;
+    done += static_cast<size_t>(n);
+  }
+  return 0;
+}
+
+// Writes the command, then waits for the end of its exchange. command_lock
+// and request_lock are held.
+int32_t exchange(AtContext* ac, const char* command, int32_t type, const char* prefix,
+                 ATResponse** out) {
+  if (ac->response != nullptr) return AT_ERROR_COMMAND_PENDING;
+  ac->command_type = type;
+  int32_t err = writeline(command);
+  if (err < 0) return err;
+
+  ac->response_prefix = prefix;
+  ac->response = static_cast<ATResponse*>(calloc(1, sizeof(ATResponse)));
+  if (ac->response == nullptr) return AT_ERROR_GENERIC;
+
+  struct timespec deadline = deadlineAfter(se_delay::scaledMicros(kCommandTimeoutMicros));
+  while (ac->response->final_response == nullptr && ac->reader_closed == 0) {
+    int rc = pthread_cond_timedwait(&ac->command_cond, &ac->command_lock, &deadline);
+    if (rc == ETIMEDOUT) {
+      if (ac->response->final_response == nullptr && ac->reader_closed == 0) {
+        return AT_ERROR_TIMEOUT;
+      }
+      break;
+    }
+  }
+
+  if (out != nullptr) {
+    reverseIntermediates(ac->response);
+    *out = ac->response;
+  } else {
+    at_response_free(ac->response);
+  }
+  ac->response = nullptr;
+  return ac->reader_closed > 0 ? AT_ERROR_CHANNEL_CLOSED : AT_OK;
+}
+
+}  // namespace
+
+// ---- context registry ------------------------------------------------------
+
+int32_t get_ac_index(void) {
+  AtContext* ac = getAtContext();
+  if (ac == nullptr) {
+    AT_LOGE("%s:getAtContext return null pointer!", "get_ac_index");
+    return -1;
+  }
+  AT_LOGD("%s:ac->index=%d,%d,%d", "get_ac_index", ac->index, g_ulModemId, currentFd(ac));
+  return ac->index;
+}
+
+// ---- reader ------------------------------------------------------------------
+
+int32_t at_open(int32_t fd, AtUnsolHandler h, int32_t index) {
+  if (index < 0 || index >= kModemSlots) {
+    // Only two reader slots exist; any other index would write past them.
+    AT_LOGE("[m%d][ch:%d] index out of range!", index, fd);
+    return -1;
+  }
+  AtContext* ac = InitializeAtContext(fd, index);
+  if (ac == nullptr) return -1;
+  if (t_readerOf == ac) {
+    // The reader cannot wait for itself to leave the record.
+    AT_LOGE("m%d_%d>at_open on the reader thread refused!", index, fd);
+    return -1;
+  }
+  retirePreviousReader(ac);
+
+  {
+    MutexGuard command(&ac->command_lock);
+    MutexGuard port(&ac->port_lock);
+    ac->index = index;
+    ac->fd = fd;
+  }
+  AT_LOGD("at_open = ac->fd=%d,ac->index=%d", fd, index);
+  ac->unsol_handler = h;
+  {
+    MutexGuard g(&ac->command_lock);
+    ac->reader_closed = 0;
+    ac->response_prefix = nullptr;
+    at_response_free(ac->response);
+    ac->response = nullptr;
+  }
+  AT_LOGD("%s,ac->index=%d,g_ulModemId=%d", "at_open", index, g_ulModemId);
+  drainWake(ac);
+  ac->eof_count = 0;
+
+  int rc;
+  {
+    MutexGuard attrs(&g_attrLock);
+    if (!g_attrInited[index]) {
+      pthread_attr_init(&reader_thread_attrs[index]);
+      g_attrInited[index] = true;
+    }
+    pthread_attr_setdetachstate(&reader_thread_attrs[index], PTHREAD_CREATE_DETACHED);
+    MutexGuard port(&ac->port_lock);
+    ac->reader_running = 1;
+    rc = pthread_create(&ac->reader_thread, &reader_thread_attrs[index], readerMain, ac);
+    if (rc != 0) ac->reader_running = 0;
+  }
+  if (rc != 0) {
+    AT_LOGE("m%d_%d>ReaderLoop create error!", index, fd);
+    // Without a reader no answer could come: commands end at once with -3.
+    MutexGuard g(&ac->command_lock);
+    ac->reader_closed = 1;
+    return -1;
+  }
+  return 0;
+}
+
+void at_close(void) {
+  AtContext* ac = getAtContext();
+  if (ac == nullptr) return;
+  // The unsolicited handler runs with command_lock held; a close from there
+  // must not take it again.
+  closePort(ac, t_inLockedHandler && t_readerOf == ac);
+  AT_LOGI("m%d_%d>at close.", g_ulModemId, ac->index);
+  // request_lock stays: a command issued after the close still takes it and
+  // must find a valid mutex (it then ends with -3).
+  MutexGuard attrs(&g_attrLock);
+  if (g_attrInited[ac->index]) {
+    pthread_attr_destroy(&reader_thread_attrs[ac->index]);
+    g_attrInited[ac->index] = false;
+  }
+}
+
+void* readerLoop(AtContext* ac) {
+  AtContext* bound = nullptr;
+  if (keyReady() && pthread_setspecific(ac_key, ac) == 0) bound = getAtContext();
+  if (bound == nullptr) {
+    if (keyReady()) AT_LOGE("getAtContext return null pointer!");
+    readerGone(ac);
+    return nullptr;
+  }
+  t_readerOf = ac;
+  at_line_reset(ac->line_buf, &ac->line_cur, &ac->read_end);
+
+  for (;;) {
+    char* line = readline(1);
+    if (line == nullptr) break;
+    if (at_is_sms_unsolicited(line)) {
+      CharBuf first(strdup(line));
+      if (!first) {
+        AT_LOGE("strdup line return null pointer!");
+        continue;
+      }
+      char* second = readline(0);
+      if (second == nullptr) break;
+      if (ac->unsol_handler != nullptr) ac->unsol_handler(first.get(), second);
+      continue;
+    }
+    MutexGuard g(&ac->command_lock);
+    processLine(ac, line);
+  }
+  readerGone(ac);
+  return nullptr;
+}
+
+char* readline(int32_t log_plain) {
+  AtContext* ac = getAtContext();
+  if (ac == nullptr) {
+    AT_LOGE("getAtContext return null pointer!");
+    return nullptr;
+  }
+  char* line = nullptr;
+  for (;;) {
+    int32_t rc = at_line_next(ac->line_buf, &ac->line_cur, &ac->read_end, readPort, ac, &line);
+    if (rc == AT_LINE_READY) break;
+    if (rc == AT_LINE_READ_ERROR) {
+      char buf[128];
+      AT_LOGE("atchannel: read error %s", errText(errno, buf, sizeof(buf)));
+      return nullptr;
+    }
+    {
+      MutexGuard g(&ac->command_lock);
+      if (ac->reader_closed != 0) return nullptr;
+    }
+    // End of file. Reading again at once would spin on a port whose writer
+    // is gone; pause (a close cuts the pause short), and take a second end
+    // of file in a row as the port being gone for good.
+    if (++ac->eof_count >= 2) {
+      AT_LOGE("atchannel: port stays at end of file");
+      return nullptr;
+    }
+    waitForWake(ac, se_delay::scaledMicros(kEofRetryMicros));
+  }
+
+  int32_t fd = currentFd(ac);
+  const char* word = at_mask_find(line);
+  if (word != nullptr) {
+    AT_LOGI("m%d_%d<%s: ***\n", ac->index, fd, word);
+  } else if ((log_plain & 1) != 0) {
+    AT_LOGI("m%d_%d<%s\n", ac->index, fd, line);
+  } else {
+    AT_LOGI("m%d_%d<: ***\n", ac->index, fd);
+  }
+  return line;
+}
+
+int32_t sync_read(int32_t fd, char* dest, int32_t max_len) {
+  if (fd < 0) {
+    AT_LOGE("Read FD is invalid\n");
+    errno = EBADF;
+    return -1;
+  }
+  memset_s(dest, static_cast<size_t>(max_len), 0, static_cast<size_t>(max_len));
+  AtContext* ac = getAtContext();
+  if (ac == nullptr) {
+    errno = EBADF;
+    return -1;
+  }
+  for (;;) {
+    // poll() rather than select(): no FD_SETSIZE limit on the port number.
+    struct pollfd pfd[2] = {{fd, POLLIN, 0}, {ac->wake_fd, POLLIN, 0}};
+    int rc = poll(pfd, 2, -1);
+    if (rc < 0) {
+      if (errno == EINTR) {
+        char buf[128];
+        AT_LOGE("sync_read error %s", errText(EINTR, buf, sizeof(buf)));
+        continue;
+      }
+      return -1;
+    }
+    bool portReady = (pfd[0].revents & (POLLIN | POLLHUP | POLLERR)) != 0;
+    bool woken = (pfd[1].revents & POLLIN) != 0;
+
+    MutexGuard g(&ac->port_lock);
+    if (ac->fd != fd) {
+      // Closed while we waited: the number may belong to someone else now.
+      AT_LOGE("Read FD is invalid\n");
+      errno = EBADF;
+      return -1;
+    }
+    if (!portReady) {
+      if (woken) {
+        drainWake(ac);  // a stray wake-up with the port still open
+        continue;
+      }
+      AT_LOGE("Read FD is not set\n");
+      errno = EBADF;
+      return -1;
+    }
+    ssize_t n;
+    do {
+      n = read(fd, dest, static_cast<size_t>(max_len));
+    } while (n < 0 && errno == EINTR);
+    if (n < 0) {
+      int saved = errno;
+      AT_LOGE("Read error \n");
+      errno = saved;
+      return -1;
+    }
+    return static_cast<int32_t>(n);
+  }
+}
+
+// ---- sender ------------------------------------------------------------------
+
+int32_t writeline(const char* s) {
+  size_t len = strlen(s);
+  for (int32_t attempt = 0; attempt < kWriteAttempts; ++attempt) {
+    int32_t rc = writeAttempt(s, len);
+    if (rc == 0) return AT_OK;
+    if (rc == AT_ERROR_CHANNEL_CLOSED) return AT_ERROR_CHANNEL_CLOSED;
+    AT_LOGE("writeline error,errno:%d", -1);
+    se_delay::sleepMicros(kWriteRetryMicros);
+  }
+  return AT_ERROR_WRITE_FAILED;
+}
+
+int32_t at_send_command_full_nolock(const char* command, int32_t type, const char* responsePrefix,
+                                    ATResponse** pp_outResponse) {
+  AtContext* ac = getAtContext();
+  if (ac == nullptr) {
+    AT_LOGE("getAtContext return null pointer!");
+    return AT_ERROR_GENERIC;
+  }
+  int rc;
+  while ((rc = pthread_mutex_trylock(&ac->request_lock)) != 0) {
+    if (rc != EBUSY) return AT_ERROR_GENERIC;
+    pthread_cond_wait(&ac->request_cond, &ac->command_lock);
+  }
+  int32_t err = exchange(ac, command, type, responsePrefix, pp_outResponse);
+  if (ac->response != nullptr) {
+    at_response_free(ac->response);
+    ac->response = nullptr;
+  }
+  ac->response_prefix = nullptr;
+  pthread_cond_broadcast(&ac->request_cond);
+  pthread_mutex_unlock(&ac->request_lock);
+  return err;
+}
+
+int32_t at_send_command_full(const char* command, int32_t type, const char* responsePrefix,
+                             ATResponse** pp_outResponse) {
+  // Callers release *out on every path; never leave it unset.
+  if (pp_outResponse != nullptr) *pp_outResponse = nullptr;
+  AtContext* ac = getAtContext();
+  if (ac == nullptr) {
+    AT_LOGE("getAtContext return null pointer!");
+    return AT_ERROR_GENERIC;
+  }
+  if (command == nullptr) return AT_ERROR_GENERIC;
+  {
+    MutexGuard g(&ac->port_lock);
+    if (pthread_equal(pthread_self(), ac->reader_thread)) return AT_ERROR_INVALID_THREAD;
+  }
+  int32_t err;
+  {
+    MutexGuard g(&ac->command_lock);
+    err = at_send_command_full_nolock(command, type, responsePrefix, pp_outResponse);
+  }
+  if ((err == AT_ERROR_TIMEOUT || err == AT_ERROR_WRITE_FAILED) && ac->on_timeout != nullptr) {
+    int32_t probe;
+    {
+      MutexGuard g(&ac->command_lock);
+      probe = at_send_command_full_nolock("AT", at_type_none, nullptr, nullptr);
+    }
+    if (probe < 0) {
+      ac->on_timeout();
+      AT_LOGE("m%d_%d< timeout.", g_ulModemId, ac->index);
+    }
+  }
+  return err;
+}
+
+int32_t at_send_command(const char* command, ATResponse** pp_outResponse) {
+  return at_send_command_full(command, at_type_none, nullptr, pp_outResponse);
+}
+
+int32_t at_send_command_singleline(const char* command, const char* responsePrefix,
+                                   ATResponse** pp_outResponse) {
+  int32_t err = at_send_command_full(command, at_type_singleline, responsePrefix, pp_outResponse);
+  if (pp_outResponse != nullptr && err == AT_OK && *pp_outResponse != nullptr &&
+      (*pp_outResponse)->success > 0 && (*pp_outResponse)->p_intermediates == nullptr) {
+    at_response_free(*pp_outResponse);
+    *pp_outResponse = nullptr;
+    return AT_ERROR_INVALID_RESPONSE;
+  }
+  return err;
+}
+
+void at_response_free(ATResponse* p_response) {
+  if (p_response == nullptr) return;
+  ATResponseLine* line = p_response->p_intermediates;
+  while (line != nullptr) {
+    ATResponseLine* next = line->next;
+    free(line->text);
+    free(line);
+    line = next;
+  }
+  free(p_response->final_response);
+  free(p_response);
+}
+
+void at_set_on_timeout(AtTimeoutCallback onTimeout) {
+  AtContext* ac = getAtContext();
+  if (ac == nullptr) {
+    AT_LOGE("getAtContext return null pointer!");
+    return;
+  }
+  ac->on_timeout = onTimeout;
+}
+
+int32_t at_get_cme_error(const ATResponse* p_response) {
+  if (p_response == nullptr) return -1;
+  if (p_response->success > 0) return 0;
+  const char* prefix = "+CME ERROR:";
+  if (p_response->final_response == nullptr ||
+      strncmp(p_response->final_response, prefix, strlen(prefix)) != 0) {
+    return -1;
+  }
+  char* cur = p_response->final_response;
+  int32_t value = 0;
+  if (at_tok_start(&cur) < 0 || at_tok_nextint(&cur, &value) < 0) return -1;
+  return value;
+}

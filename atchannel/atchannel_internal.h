@@ -1,0 +1,51 @@
+#pragma once
+// Inside of the AT channel: the per-port record and the steps the public
+// operations are built from. Only the channel's own sources include this.
+#include <pthread.h>
+
+#include <cstdint>
+
+#include "at_line.h"
+#include "atchannel.h"
+
+struct AtContext {
+  pthread_t reader_thread;
+  int32_t index;
+  int32_t fd;
+  AtUnsolHandler unsol_handler;
+  char line_buf[AT_LINE_BUF_SIZE];
+  char* line_cur;
+  pthread_mutex_t request_lock;
+  pthread_mutex_t command_lock;
+  pthread_cond_t request_cond;
+  pthread_cond_t command_cond;
+  pthread_condattr_t command_cond_attr;
+  int32_t command_type;
+  const char* response_prefix;
+  ATResponse* response;
+  AtTimeoutCallback on_timeout;
+  int32_t reader_closed;
+  char* read_end;
+
+  // Guards the port descriptor against being closed, and its number reused,
+  // while the reader reads it; also `reader_thread` and `reader_running`.
+  // `fd` changes only with both this and `command_lock` held.
+  pthread_mutex_t port_lock;
+  pthread_cond_t reader_gone_cond;  // broadcast when a reader has left the record
+  int32_t reader_running;
+  // Counter descriptor signalled by at_close, polled by the reader beside the
+  // port so that a close wakes it at once. Lives as long as the record.
+  int32_t wake_fd;
+  // Reader-only: zero-byte reads in a row since the last data.
+  int32_t eof_count;
+};
+
+void* readerLoop(AtContext* ac);
+char* readline(int32_t log_plain);
+int32_t sync_read(int32_t fd, char* dest, int32_t max_len);
+
+int32_t at_send_command_full(const char* command, int32_t type, const char* responsePrefix,
+                             ATResponse** pp_outResponse);
+int32_t at_send_command_full_nolock(const char* command, int32_t type,
+                                    const char* responsePrefix, ATResponse** pp_outResponse);
+int32_t writeline(const char* s);
