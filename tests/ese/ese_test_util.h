@@ -1,0 +1,154 @@
+#pragma once
+// Shared pieces of the eSE front tests: a recording client callback, helpers
+// that run one operation and hand back what its result callback got.
+#include <atomic>
+#include <cstdio>
+#include <cstdint>
+#include <mutex>
+#include <string>
+#include <vector>
+
+#include <android/hardware/secure_element/1.0/ISecureElement.h>
+#include <host/log_capture.h>
+
+#include "SecureElement.h"
+#include "fake_ese_hal.h"
+
+namespace ese_test {
+
+using ::android::sp;
+using ::android::hardware::hidl_death_recipient;
+using ::android::hardware::hidl_vec;
+using ::android::hardware::Return;
+using ::android::hardware::secure_element::V1_0::ISecureElementHalCallback;
+using ::android::hardware::secure_element::V1_0::LogicalChannelResponse;
+using ::android::hardware::secure_element::V1_0::SecureElementStatus;
+using ::android::hardware::secure_element::V1_0::implementation::SecureElement;
+
+using Bytes = std::vector<uint8_t>;
+
+struct FakeClient : public ISecureElementHalCallback {
+  std::atomic<int> connected{0};
+  std::atomic<int> disconnected{0};
+  std::mutex mu;
+  std::vector<uint64_t> linkCookies;
+  std::vector<sp<hidl_death_recipient>> linkRecipients;
+
+  Return<void> onStateChange(bool isConnected) override {
+    (isConnected ? connected : disconnected)++;
+    return ::android::hardware::Void();
+  }
+  Return<bool> linkToDeath(const sp<hidl_death_recipient>& recipient, uint64_t cookie) override {
+    std::lock_guard<std::mutex> l(mu);
+    linkCookies.push_back(cookie);
+    linkRecipients.push_back(recipient);
+    return true;
+  }
+};
+
+struct LogicalResult {
+  int calls = 0;
+  uint8_t channel = 0;
+  Bytes select;
+  SecureElementStatus status = SecureElementStatus::SUCCESS;
+};
+
+struct BasicResult {
+  int calls = 0;
+  Bytes select;
+  SecureElementStatus status = SecureElementStatus::SUCCESS;
+};
+
+inline LogicalResult openLogical(const sp<SecureElement>& se, const Bytes& aid, uint8_t p2) {
+  LogicalResult r;
+  se->openLogicalChannel(hidl_vec<uint8_t>(aid), p2,
+                         [&](const LogicalChannelResponse& resp, SecureElementStatus st) {
+                           ++r.calls;
+                           r.channel = resp.channelNumber;
+                           r.select = resp.selectResponse;
+                           r.status = st;
+                         });
+  return r;
+}
+
+inline BasicResult openBasic(const sp<SecureElement>& se, const Bytes& aid, uint8_t p2) {
+  BasicResult r;
+  se->openBasicChannel(hidl_vec<uint8_t>(aid), p2,
+                       [&](const hidl_vec<uint8_t>& resp, SecureElementStatus st) {
+                         ++r.calls;
+                         r.select = resp;
+                         r.status = st;
+                       });
+  return r;
+}
+
+// The response and how many times the callback ran.
+inline std::pair<int, Bytes> transmit(const sp<SecureElement>& se, const Bytes& apdu) {
+  std::pair<int, Bytes> r{0, {}};
+  se->transmit(hidl_vec<uint8_t>(apdu), [&](const hidl_vec<uint8_t>& resp) {
+    ++r.first;
+    r.second = resp;
+  });
+  return r;
+}
+
+// A record with exactly this text, tag "qvese@1.0-service", main buffer and
+// the given priority.
+inline bool logged(const ::android::host::LogCapture& cap, const std::string& text, int priority) {
+  for (const auto& rec : cap.records()) {
+    if (rec.text == text && rec.tag == "qvese@1.0-service" && rec.buffer == 0 &&
+        rec.priority == priority)
+      return true;
+  }
+  return false;
+}
+
+}  // namespace ese_test
+
+namespace ese_test {
+
+const Bytes kAid = {0xA0, 0x00, 0x00, 0x01, 0x51};
+
+constexpr const char* kManageOpen = "ipc 00 70 00 00 01";
+constexpr const char* kPowerOff = "power korva_poweroff";
+
+inline std::string hex2(uint8_t b) {
+  char buf[3];
+  std::snprintf(buf, sizeof(buf), "%02X", b);
+  return buf;
+}
+
+// The call log line of a SELECT by DF name for kAid.
+inline std::string selectLine(uint8_t cla, uint8_t p2) {
+  return "trx " + hex2(cla) + " A4 04 " + hex2(p2) + " lc=" + std::to_string(kAid.size()) + " " +
+         fake_ese::hex(kAid) + " le_type=1 le=256 rlen=2";
+}
+
+// The call log line of MANAGE CHANNEL close for channel c.
+inline std::string closeLine(uint8_t c) {
+  return "trx " + hex2(c) + " 70 80 " + hex2(c) + " lc=0 le_type=0 le=36864 rlen=0";
+}
+
+// Scripts a MANAGE CHANNEL open answered with channel c and a SELECT answered
+// 90 00, so that channel c ends up open and flagged.
+inline void scriptOpen(uint8_t c) {
+  fake_ese::queueIpc({0, {c, 0x90, 0x00}});
+  fake_ese::queueTransceive({0, {}, 0x90, 0x00});
+}
+
+}  // namespace ese_test
+
+namespace ese_test {
+
+// Leaves no channel flagged from an earlier test in the same process: an init
+// whose ready status is 0 closes every flagged channel 1..3. The fake library
+// is reset before and after.
+inline void sweepFlags(const sp<SecureElement>& se) {
+  fake_ese::reset();
+  for (int i = 0; i < 3; ++i) fake_ese::queueTransceive({0, {}, 0x90, 0x00});
+  sp<FakeClient> sweeper = new FakeClient();
+  se->init(sweeper);
+  fake_ese::reset();
+}
+
+}  // namespace ese_test
