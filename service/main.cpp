@@ -1,0 +1,3 @@
+#include "service.h"
+
+int main() { return qvese_service_main(); }
