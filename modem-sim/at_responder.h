@@ -1,0 +1,52 @@
+#pragma once
+// The AT side of the modem simulator: one command line in, the answer lines
+// out, for a virtual UICC (the virtual card) behind the 3GPP TS 27.007
+// commands the daemon uses. No I/O here.
+#include <cstdint>
+#include <string>
+#include <vector>
+
+#include "virtual_card.h"
+
+namespace modem_sim {
+
+struct ResponderOptions {
+  bool cardAbsent = false;
+  std::vector<uint8_t> atr;  // empty: the card's default ATR
+  int channels = se_card::kMaxChannels;
+  // Session id of channel c is sessionBase + c; with a base that is a
+  // multiple of 32 the low five bits of the id give the channel.
+  int sessionBase = 0x100;
+};
+
+// Error codes of "+CME ERROR:" answers.
+constexpr int kCmeSimNotInserted = 10;
+constexpr int kCmeNoSuchApplet = 716;
+constexpr int kCmeNoChannel = 717;
+constexpr int kCmeCardError = 760;
+
+class AtResponder {
+ public:
+  explicit AtResponder(const ResponderOptions& options);
+
+  // The lines (without line ends) that answer one command line; the last is
+  // the final result ("OK", "ERROR" or "+CME ERROR: n").
+  std::vector<std::string> handle(const std::string& line);
+
+  se_card::VirtualCard& card() { return card_; }
+
+ private:
+  std::vector<std::string> openChannel(const std::vector<uint8_t>& aid, uint8_t p2, const char* prefix);
+  std::vector<std::string> exchange(const std::vector<uint8_t>& apdu, const char* prefix);
+  int channelOfSession(long session) const;
+
+  ResponderOptions options_;
+  se_card::VirtualCard card_;
+  long sessions_[se_card::kMaxChannels] = {};  // 0: no session on that channel
+};
+
+// Hex text (either case) to bytes; false for odd length or a non-hex character.
+bool decodeHex(const std::string& text, std::vector<uint8_t>& out);
+std::string encodeHex(const std::vector<uint8_t>& bytes);
+
+}  // namespace modem_sim
