@@ -35,7 +35,9 @@ extern "C" int property_get(const char* key, char* value, const char* default_va
       found = true;
     }
   }
-  if (!found) result = default_value ? default_value : "";
+  // As on the device, an empty value counts as unset, so appending "name="
+  // returns a property to its default.
+  if (!found || result.empty()) result = default_value ? default_value : "";
   if (result.size() > PROPERTY_VALUE_MAX - 1) result.resize(PROPERTY_VALUE_MAX - 1);
   memcpy(value, result.c_str(), result.size() + 1);
   return static_cast<int>(result.size());

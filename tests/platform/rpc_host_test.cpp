@@ -1,0 +1,545 @@
+// The RPC host end to end: a FakeSecureElement registered over the real Unix
+// sockets, called through the client proxies (and through raw sockets for
+// the frames a proxy would never send).
+#include <gtest/gtest.h>
+
+#include <android/log.h>
+#include <host/log_capture.h>
+#include <host/rpc_hooks.h>
+#include <host/rpc_wire.h>
+
+#include <signal.h>
+#include <sys/socket.h>
+#include <sys/stat.h>
+#include <sys/un.h>
+#include <sys/wait.h>
+
+#include <cstring>
+#include <fstream>
+
+#include "rpc_test_util.h"
+
+namespace {
+
+using namespace fake;
+using ::android::OK;
+using ::android::host::LogCapture;
+using ::android::host::rpc::encodeFrame;
+using ::android::host::rpc::Frame;
+using ::android::host::rpc::FrameKind;
+using ::android::host::rpc::kMaxBodySize;
+
+class ClientCallback : public ISecureElementHalCallback {
+ public:
+  Return<void> onStateChange(bool connected) override {
+    std::lock_guard<std::mutex> g(mLock);
+    states.push_back(connected);
+    sawInitReturned.push_back(initReturned.load());
+    return Void();
+  }
+  std::atomic<bool> initReturned{false};
+  std::vector<bool> states;
+  std::vector<bool> sawInitReturned;
+  std::mutex mLock;
+};
+
+int connectRaw(const std::string& name) {
+  int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+  sockaddr_un addr{};
+  addr.sun_family = AF_UNIX;
+  std::string path = ::android::host::serviceSocketPath(name);
+  strncpy(addr.sun_path, path.c_str(), sizeof(addr.sun_path) - 1);
+  if (connect(fd, reinterpret_cast<sockaddr*>(&addr), sizeof(addr)) != 0) {
+    close(fd);
+    return -1;
+  }
+  return fd;
+}
+
+// True when the server ends the connection within the test limit.
+bool closedByServer(int fd) {
+  char buf[256];
+  for (;;) {
+    pollfd pfd{fd, POLLIN, 0};
+    if (poll(&pfd, 1, 10000) != 1) return false;
+    ssize_t n = recv(fd, buf, sizeof(buf), 0);
+    if (n == 0 || (n < 0 && errno == ECONNRESET)) return true;
+    if (n < 0) return false;
+  }
+}
+
+std::vector<uint8_t> frameBytes(FrameKind kind, uint32_t id, uint32_t object, uint32_t code,
+                                std::vector<uint8_t> body) {
+  Frame f;
+  f.kind = kind;
+  f.id = id;
+  f.object = object;
+  f.code = code;
+  f.body = std::move(body);
+  std::vector<uint8_t> out;
+  encodeFrame(f, &out);
+  return out;
+}
+
+void putU32(std::vector<uint8_t>& v, size_t at, uint32_t x) {
+  for (int i = 0; i < 4; ++i) v[at + i] = static_cast<uint8_t>(x >> (8 * i));
+}
+
+class RpcHostTest : public ::testing::Test {
+ protected:
+  void startServer(size_t threads) { server = std::make_unique<Server>(se, "SIM1", threads); }
+  void TearDown() override {
+    if (server) server->stop();
+  }
+  TempRoot root;
+  sp<FakeSecureElement> se = new FakeSecureElement();
+  std::unique_ptr<Server> server;
+};
+
+TEST_F(RpcHostTest, EveryOperationRoundTrips) {
+  startServer(2);
+  ASSERT_EQ(server->status(), OK);
+  sp<ISecureElement> client = ISecureElement::getService("SIM1");
+  ASSERT_NE(client, nullptr);
+  EXPECT_TRUE(client->isRemote());
+
+  sp<ClientCallback> cb = new ClientCallback();
+  ASSERT_TRUE(client->init(cb).isOk());
+  ASSERT_NE(se->callback(), nullptr);
+  EXPECT_TRUE(se->callback()->isRemote());
+
+  std::vector<uint8_t> atr;
+  ASSERT_TRUE(client->getAtr([&](const hidl_vec<uint8_t>& r) { atr = r; }).isOk());
+  EXPECT_EQ(atr, kFakeAtr);
+
+  for (bool present : {true, false}) {
+    se->present = present;
+    Return<bool> r = client->isCardPresent();
+    ASSERT_TRUE(r.isOk());
+    EXPECT_EQ(static_cast<bool>(r), present);
+  }
+
+  // Empty, short, and the largest extended APDU with its response.
+  std::vector<uint8_t> big(65544);
+  for (size_t i = 0; i < big.size(); ++i) big[i] = static_cast<uint8_t>(i * 7);
+  for (const std::vector<uint8_t>& apdu :
+       {std::vector<uint8_t>{}, std::vector<uint8_t>{0x00, 0xA4, 0x04, 0x00}, big}) {
+    std::vector<uint8_t> resp;
+    ASSERT_TRUE(client->transmit(apdu, [&](const hidl_vec<uint8_t>& r) { resp = r; }).isOk());
+    EXPECT_EQ(se->lastTransmit(), apdu);
+    std::vector<uint8_t> want = apdu;
+    want.push_back(0x90);
+    want.push_back(0x00);
+    EXPECT_EQ(resp, want);
+  }
+
+  struct OpenCase {
+    std::vector<uint8_t> aid;
+    uint8_t p2;
+    SecureElementStatus status;
+    uint8_t channel;
+  };
+  for (const OpenCase& c : {OpenCase{{0xA0, 0x00, 0x00, 0x01, 0x51}, 0x00,
+                                     SecureElementStatus::SUCCESS, 1},
+                            OpenCase{{0xA0, 0x01}, 0xFF, SecureElementStatus::SUCCESS, 2},
+                            OpenCase{{0xFF, 0x01}, 0x0C,
+                                     SecureElementStatus::NO_SUCH_ELEMENT_ERROR, 0}}) {
+    LogicalChannelResponse got;
+    SecureElementStatus status = SecureElementStatus::IOERROR;
+    ASSERT_TRUE(client
+                    ->openLogicalChannel(c.aid, c.p2,
+                                         [&](const LogicalChannelResponse& r,
+                                             SecureElementStatus s) {
+                                           got = r;
+                                           status = s;
+                                         })
+                    .isOk());
+    EXPECT_EQ(se->lastAid(), c.aid);
+    EXPECT_EQ(se->lastP2(), c.p2);
+    EXPECT_EQ(status, c.status);
+    EXPECT_EQ(got.channelNumber, c.channel);
+    if (c.status == SecureElementStatus::SUCCESS) {
+      std::vector<uint8_t> sel = {0x6F, 0x0A};
+      sel.insert(sel.end(), c.aid.begin(), c.aid.end());
+      sel.push_back(0x90);
+      sel.push_back(0x00);
+      EXPECT_EQ(std::vector<uint8_t>(got.selectResponse), sel);
+    } else {
+      EXPECT_EQ(got.selectResponse.size(), 0u);
+    }
+  }
+
+  std::vector<uint8_t> basicSel;
+  SecureElementStatus basicStatus = SecureElementStatus::IOERROR;
+  ASSERT_TRUE(client
+                  ->openBasicChannel({0xA0, 0x02}, 0x04,
+                                     [&](const hidl_vec<uint8_t>& r, SecureElementStatus s) {
+                                       basicSel = r;
+                                       basicStatus = s;
+                                     })
+                  .isOk());
+  EXPECT_EQ(basicSel, (std::vector<uint8_t>{0xA0, 0x02, 0x04, 0x90, 0x00}));
+  EXPECT_EQ(basicStatus, SecureElementStatus::SUCCESS);
+
+  Return<SecureElementStatus> closed = client->closeChannel(2);
+  ASSERT_TRUE(closed.isOk());
+  EXPECT_EQ(static_cast<SecureElementStatus>(closed), SecureElementStatus::SUCCESS);
+  EXPECT_EQ(se->lastClose(), 2);
+  closed = client->closeChannel(200);
+  ASSERT_TRUE(closed.isOk());
+  EXPECT_EQ(static_cast<SecureElementStatus>(closed), SecureElementStatus::FAILED);
+  EXPECT_EQ(se->lastClose(), 200);
+}
+
+TEST_F(RpcHostTest, InitCallbackReachesClientBeforeInitReturns) {
+  startServer(2);
+  sp<ISecureElement> client = ISecureElement::getService("SIM1");
+  ASSERT_NE(client, nullptr);
+  sp<ClientCallback> cb = new ClientCallback();
+  ASSERT_TRUE(client->init(cb).isOk());
+  cb->initReturned = true;
+  ASSERT_EQ(cb->states, std::vector<bool>{true});
+  EXPECT_EQ(cb->sawInitReturned, std::vector<bool>{false});
+
+  // A null callback reaches the service as null.
+  ASSERT_TRUE(client->init(nullptr).isOk());
+  EXPECT_EQ(se->callback(), nullptr);
+}
+
+TEST_F(RpcHostTest, ClientReceivesCallbackAfterItsCallReturned) {
+  se->deferStateChange = true;
+  startServer(2);
+  sp<ISecureElement> client = ISecureElement::getService("SIM1");
+  ASSERT_NE(client, nullptr);
+  sp<ClientCallback> cb = new ClientCallback();
+  ASSERT_TRUE(client->init(cb).isOk());
+  EXPECT_TRUE(cb->states.empty());
+  EXPECT_EQ(::android::host::pollIncomingCalls(client, 20), 0);
+
+  // The service's call waits until the client reads it.
+  std::atomic<bool> serviceCallOk{false};
+  std::thread later([&] { serviceCallOk = se->callback()->onStateChange(true).isOk(); });
+  EXPECT_EQ(::android::host::pollIncomingCalls(client, 10000), 1);
+  later.join();
+  EXPECT_TRUE(serviceCallOk);
+  EXPECT_EQ(cb->states, std::vector<bool>{true});
+}
+
+TEST_F(RpcHostTest, PoolOfTwoRunsTwoCallsAtOnceAndTheThirdWaits) {
+  se->blockTransmit = true;
+  startServer(2);
+  std::atomic<int> ok{0};
+  std::vector<std::thread> callers;
+  for (int i = 0; i < 3; ++i) {
+    callers.emplace_back([&, i] {
+      sp<ISecureElement> client = ISecureElement::getService("SIM1");
+      if (client == nullptr) return;
+      std::vector<uint8_t> resp;
+      auto r = client->transmit({static_cast<uint8_t>(i)},
+                                [&](const hidl_vec<uint8_t>& x) { resp = x; });
+      if (r.isOk() && resp.size() == 3 && resp[0] == i) ++ok;
+    });
+  }
+  EXPECT_TRUE(se->waitEntered(2));
+  EXPECT_FALSE(se->enteredWithin(3, std::chrono::milliseconds(300)));
+  se->release(1);
+  EXPECT_TRUE(se->waitEntered(3));
+  se->release(2);
+  for (auto& t : callers) t.join();
+  EXPECT_EQ(ok, 3);
+  EXPECT_EQ(se->maxRunning(), 2);
+}
+
+TEST_F(RpcHostTest, KilledClientProcessTriggersServiceDied) {
+  // The child is forked before any thread exists in this process.
+  int go[2], ready[2];
+  ASSERT_EQ(pipe(go), 0);
+  ASSERT_EQ(pipe(ready), 0);
+  pid_t pid = fork();
+  ASSERT_GE(pid, 0);
+  if (pid == 0) {
+    close(go[1]);
+    close(ready[0]);
+    if (readByte(go[0]) != 'G') _exit(2);
+    sp<ISecureElement> client = ISecureElement::getService("SIM1");
+    if (client == nullptr) _exit(3);
+    sp<ClientCallback> cb = new ClientCallback();
+    if (!client->init(cb).isOk()) _exit(4);
+    if (write(ready[1], "R", 1) != 1) _exit(5);
+    for (;;) pause();
+  }
+  close(go[0]);
+  close(ready[1]);
+  startServer(2);
+  ASSERT_EQ(write(go[1], "G", 1), 1);
+  ASSERT_EQ(readByte(ready[0]), 'R');
+  EXPECT_TRUE(se->watcher->cookies().empty());
+  kill(pid, SIGKILL);
+  int status = 0;
+  waitpid(pid, &status, 0);
+  ASSERT_TRUE(se->watcher->waitDeaths(1));
+  EXPECT_EQ(se->watcher->cookies(), std::vector<uint64_t>{0});
+  EXPECT_EQ(se->watcher->lastWho().promote(), se->callback());
+  close(go[1]);
+  close(ready[0]);
+}
+
+TEST_F(RpcHostTest, ClosedConnectionNotifiesLinkedAndNotUnlinkedRecipients) {
+  // One pool thread runs the notifications in the order they were linked.
+  startServer(1);
+  sp<ISecureElement> client = ISecureElement::getService("SIM1");
+  ASSERT_NE(client, nullptr);
+  sp<ClientCallback> cb = new ClientCallback();
+  ASSERT_TRUE(client->init(cb).isOk());
+  sp<DeathWatcher> unlinked = new DeathWatcher();
+  sp<DeathWatcher> linked = new DeathWatcher();
+  sp<ISecureElementHalCallback> proxy = se->callback();
+  ASSERT_TRUE(proxy->linkToDeath(unlinked, 5).isOk());
+  ASSERT_TRUE(proxy->linkToDeath(linked, 7));
+  ASSERT_TRUE(proxy->unlinkToDeath(unlinked));
+  EXPECT_FALSE(proxy->unlinkToDeath(unlinked));
+
+  client = nullptr;  // the last reference closes the connection
+  ASSERT_TRUE(linked->waitDeaths(1));
+  ASSERT_TRUE(se->watcher->waitDeaths(1));
+  EXPECT_EQ(linked->cookies(), std::vector<uint64_t>{7});
+  EXPECT_TRUE(unlinked->cookies().empty());
+
+  // The client is gone: calls on its callback fail at once and link fails.
+  EXPECT_FALSE(proxy->onStateChange(true).isOk());
+  EXPECT_FALSE(static_cast<bool>(proxy->linkToDeath(linked, 9)));
+}
+
+TEST_F(RpcHostTest, BadFramesCloseOnlyTheirConnection) {
+  // A single pool thread: an idle half frame must not hold it.
+  startServer(1);
+  int idle = connectRaw("SIM1");
+  ASSERT_GE(idle, 0);
+  std::vector<uint8_t> half = frameBytes(FrameKind::Call, 1, 0, 3, {});
+  ASSERT_EQ(send(idle, half.data(), 10, 0), 10);
+
+  sp<ISecureElement> good = ISecureElement::getService("SIM1");
+  ASSERT_NE(good, nullptr);
+
+  std::vector<uint8_t> badMagic = frameBytes(FrameKind::Call, 1, 0, 3, {});
+  badMagic[0] ^= 0xFF;
+  std::vector<uint8_t> badKind = frameBytes(FrameKind::Call, 1, 0, 3, {});
+  putU32(badKind, 4, 9);
+  std::vector<uint8_t> oversized = frameBytes(FrameKind::Call, 1, 0, 4, {});
+  putU32(oversized, 20, static_cast<uint32_t>(kMaxBodySize + 1));
+  std::vector<uint8_t> huge = frameBytes(FrameKind::Call, 1, 0, 4, {});
+  putU32(huge, 20, 0xFFFFFFFFu);
+  std::vector<uint8_t> truncated = frameBytes(FrameKind::Call, 1, 0, 4, std::vector<uint8_t>(100));
+  truncated.resize(40);
+  // transmit whose byte string claims more than the body holds
+  std::vector<uint8_t> argPastBody = frameBytes(FrameKind::Call, 1, 0, 4, {0xE8, 0x03, 0, 0, 1});
+  std::vector<uint8_t> trailingBytes = frameBytes(FrameKind::Call, 1, 0, 3, {0x00});
+  std::vector<uint8_t> badChannelArg = frameBytes(FrameKind::Call, 1, 0, 7, {});
+
+  struct Case {
+    const char* name;
+    std::vector<uint8_t> bytes;
+    bool endStream;  // the client stops sending after the bytes
+  };
+  const Case cases[] = {
+      {"bad magic", badMagic, false},
+      {"unknown frame kind", badKind, false},
+      {"body over the limit", oversized, false},
+      {"body length 4 GiB", huge, false},
+      {"frame cut short", truncated, true},
+      {"unknown method", frameBytes(FrameKind::Call, 1, 0, 99, {}), false},
+      {"call to an unknown object", frameBytes(FrameKind::Call, 1, 5, 3, {}), false},
+      {"argument longer than the body", argPastBody, false},
+      {"bytes after the arguments", trailingBytes, false},
+      {"missing argument", badChannelArg, false},
+      {"answer to no call", frameBytes(FrameKind::Reply, 77, 0, 0, {}), false},
+  };
+  for (const Case& c : cases) {
+    SCOPED_TRACE(c.name);
+    LogCapture cap;
+    int fd = connectRaw("SIM1");
+    ASSERT_GE(fd, 0);
+    ASSERT_EQ(send(fd, c.bytes.data(), c.bytes.size(), MSG_NOSIGNAL),
+              static_cast<ssize_t>(c.bytes.size()));
+    if (c.endStream) shutdown(fd, SHUT_WR);
+    EXPECT_TRUE(closedByServer(fd));
+    close(fd);
+    bool logged = false;
+    for (auto& r : cap.records()) {
+      if (r.tag == "hidl_host" && r.priority == ANDROID_LOG_ERROR) logged = true;
+    }
+    EXPECT_TRUE(logged);
+    // Everyone else is still served.
+    Return<bool> r = good->isCardPresent();
+    EXPECT_TRUE(r.isOk());
+  }
+  // The idle half frame is still pending, not dropped.
+  pollfd pfd{idle, POLLIN, 0};
+  EXPECT_EQ(poll(&pfd, 1, 0), 0);
+  close(idle);
+}
+
+TEST_F(RpcHostTest, OperationWithoutResultGivesClientAnError) {
+  startServer(2);
+  sp<ISecureElement> client = ISecureElement::getService("SIM1");
+  ASSERT_NE(client, nullptr);
+  se->skipResult = true;
+  bool called = false;
+  EXPECT_FALSE(client->getAtr([&](const hidl_vec<uint8_t>&) { called = true; }).isOk());
+  EXPECT_FALSE(client->transmit({0x00}, [&](const hidl_vec<uint8_t>&) { called = true; }).isOk());
+  EXPECT_FALSE(client
+                   ->openLogicalChannel({0xA0}, 0,
+                                        [&](const LogicalChannelResponse&,
+                                            SecureElementStatus) { called = true; })
+                   .isOk());
+  EXPECT_FALSE(client
+                   ->openBasicChannel({0xA0}, 0,
+                                      [&](const hidl_vec<uint8_t>&, SecureElementStatus) {
+                                        called = true;
+                                      })
+                   .isOk());
+  EXPECT_FALSE(called);
+  // The connection stays usable.
+  se->skipResult = false;
+  EXPECT_TRUE(client->isCardPresent().isOk());
+}
+
+TEST_F(RpcHostTest, SecondResultIsDroppedAndLogged) {
+  startServer(2);
+  sp<ISecureElement> client = ISecureElement::getService("SIM1");
+  ASSERT_NE(client, nullptr);
+  LogCapture cap;
+  se->doubleResult = true;
+  std::vector<std::vector<uint8_t>> got;
+  ASSERT_TRUE(client->getAtr([&](const hidl_vec<uint8_t>& r) { got.push_back(r); }).isOk());
+  EXPECT_EQ(got, std::vector<std::vector<uint8_t>>{kFakeAtr});
+  EXPECT_TRUE(cap.contains("getAtr: result callback called again", "hidl_host"));
+}
+
+TEST_F(RpcHostTest, CallTimeoutAndVanishedServiceGiveErrorsNotHangs) {
+  se->blockTransmit = true;
+  startServer(2);
+  sp<ISecureElement> client = ISecureElement::getService("SIM1");
+  sp<ISecureElement> other = ISecureElement::getService("SIM1");
+  ASSERT_NE(client, nullptr);
+  ASSERT_NE(other, nullptr);
+  ASSERT_TRUE(::android::host::setCallTimeout(client, 100));
+  EXPECT_FALSE(client->transmit({0x01}, [](const hidl_vec<uint8_t>&) {}).isOk());
+  // The late reply cannot be matched any more: the connection is closed.
+  EXPECT_FALSE(client->isCardPresent().isOk());
+  se->release(1);
+
+  server->stop();
+  EXPECT_FALSE(other->isCardPresent().isOk());
+  EXPECT_EQ(ISecureElement::getService("SIM1"), nullptr);
+  EXPECT_EQ(ISecureElement::getService("nothing"), nullptr);
+}
+
+TEST_F(RpcHostTest, RegistrationMakesPrivateSocketAndReplacesStaleOne) {
+  std::string dir = root.path() + "/dev/socket/secure_element";
+  std::filesystem::create_directories(dir);
+  // A socket file left by a daemon that is gone.
+  int stale = socket(AF_UNIX, SOCK_STREAM, 0);
+  sockaddr_un addr{};
+  addr.sun_family = AF_UNIX;
+  strncpy(addr.sun_path, (dir + "/SIM1").c_str(), sizeof(addr.sun_path) - 1);
+  ASSERT_EQ(bind(stale, reinterpret_cast<sockaddr*>(&addr), sizeof(addr)), 0);
+  close(stale);
+  EXPECT_TRUE(::android::host::listServices().empty());
+
+  startServer(2);
+  ASSERT_EQ(server->status(), OK);
+  struct stat st;
+  ASSERT_EQ(stat(dir.c_str(), &st), 0);
+  EXPECT_EQ(st.st_mode & 0777, 0700u);
+  ASSERT_EQ(stat((dir + "/SIM1").c_str(), &st), 0);
+  EXPECT_TRUE(S_ISSOCK(st.st_mode));
+  EXPECT_EQ(st.st_mode & 0777, 0600u);
+  EXPECT_EQ(::android::host::listServices(), std::vector<std::string>{"SIM1"});
+  sp<ISecureElement> client = ISecureElement::getService("SIM1");
+  ASSERT_NE(client, nullptr);
+  EXPECT_TRUE(client->isCardPresent().isOk());
+}
+
+TEST_F(RpcHostTest, RegistrationFailsWhenTheSocketCannotBeMade) {
+  // The device root is a plain file: no folder can be made below it.
+  std::string file = root.path() + "/not-a-folder";
+  { std::ofstream(file) << "x"; }
+  setenv("SE_DEVICE_ROOT", file.c_str(), 1);
+  LogCapture cap;
+  EXPECT_NE(se->registerAsService("SIM1"), OK);
+  EXPECT_TRUE(cap.contains("cannot create", "hidl_host"));
+  EXPECT_NE(se->registerAsService("bad/name"), OK);
+  ::android::host::shutdownRpcHostForTest();
+}
+
+TEST_F(RpcHostTest, HooksStandInForRegistryAndPool) {
+  std::vector<std::string> calls;
+  ::android::host::RpcHooks hooks;
+  hooks.registerService = [&](const std::string& d, const std::string& n,
+                              const sp<IBase>& s) -> ::android::status_t {
+    calls.push_back("register " + d + " " + n);
+    EXPECT_EQ(s.get(), static_cast<IBase*>(se.get()));
+    return n == "eSE1" ? ::android::UNKNOWN_ERROR : OK;
+  };
+  hooks.configureThreadpool = [&](size_t n, bool join) {
+    calls.push_back("configure " + std::to_string(n) + (join ? " join" : ""));
+  };
+  hooks.joinThreadpool = [&] { calls.push_back("join"); };
+  ::android::host::setRpcHooks(&hooks);
+  ::android::hardware::configureRpcThreadpool(2, true);
+  EXPECT_EQ(se->registerAsService("SIM1"), OK);
+  EXPECT_NE(se->registerAsService("eSE1"), OK);
+  ::android::hardware::joinRpcThreadpool();
+  ::android::host::setRpcHooks(nullptr);
+  EXPECT_EQ(calls, (std::vector<std::string>{
+                       "configure 2 join",
+                       "register android.hardware.secure_element@1.0::ISecureElement SIM1",
+                       "register android.hardware.secure_element@1.0::ISecureElement eSE1",
+                       "join"}));
+  // Nothing was really registered.
+  EXPECT_TRUE(::android::host::listServices().empty());
+}
+
+TEST_F(RpcHostTest, ForeignUserIsRefused) {
+  if (geteuid() != 0) GTEST_SKIP() << "needs root to run a client under another user id";
+  int go[2], done[2];
+  ASSERT_EQ(pipe(go), 0);
+  ASSERT_EQ(pipe(done), 0);
+  pid_t pid = fork();
+  ASSERT_GE(pid, 0);
+  if (pid == 0) {
+    close(go[1]);
+    close(done[0]);
+    if (readByte(go[0]) != 'G') _exit(2);
+    if (setgid(65534) != 0 || setuid(65534) != 0) _exit(3);
+    sp<ISecureElement> client = ISecureElement::getService("SIM1");
+    if (client == nullptr) _exit(4);  // the socket folder should have let us in
+    _exit(client->isCardPresent().isOk() ? 5 : 0);
+  }
+  close(go[0]);
+  close(done[1]);
+  startServer(2);
+  // Open the file system guard, so that only the peer check stands in the way.
+  std::string dir = root.path() + "/dev/socket/secure_element";
+  for (const std::string& d :
+       {root.path(), root.path() + "/dev", root.path() + "/dev/socket", dir}) {
+    chmod(d.c_str(), 0755);
+  }
+  chmod((dir + "/SIM1").c_str(), 0666);
+  LogCapture cap;
+  ASSERT_EQ(write(go[1], "G", 1), 1);
+  int status = 0;
+  ASSERT_EQ(waitpid(pid, &status, 0), pid);
+  ASSERT_TRUE(WIFEXITED(status));
+  EXPECT_EQ(WEXITSTATUS(status), 0);
+  EXPECT_TRUE(cap.contains("refused connection to SIM1 from uid 65534", "hidl_host"));
+  // Our own user is still served.
+  sp<ISecureElement> client = ISecureElement::getService("SIM1");
+  ASSERT_NE(client, nullptr);
+  EXPECT_TRUE(client->isCardPresent().isOk());
+  close(go[1]);
+  close(done[0]);
+}
+
+}  // namespace
