@@ -7,6 +7,7 @@
 #include <stdio.h>
 #include <stdlib.h>
 #include <string.h>
+#include <sys/ioctl.h>
 #include <sys/stat.h>
 #include <termios.h>
 #include <time.h>
@@ -209,6 +210,7 @@ class Modem {
     }
     if (o_.closeAfter > 0 && commands_ >= o_.closeAfter) {
       logLine("#", "closing the port after " + std::to_string(commands_) + " commands");
+      awaitDrained();
       closePort();
     }
   }
@@ -239,6 +241,16 @@ class Modem {
         logLine("#", std::string("write failed: ") + strerror(errno));
         return;
       }
+    }
+  }
+
+  // Closing the master drops what the client has not read yet: give it up
+  // to a second to take the last answer first.
+  void awaitDrained() {
+    for (int i = 0; i < 200 && !g_stop && slave_ >= 0; ++i) {
+      int pending = 0;
+      if (ioctl(slave_, FIONREAD, &pending) != 0 || pending == 0) return;
+      sleepMs(5);
     }
   }
 
