@@ -1,0 +1,277 @@
+// The SIM front's operations over the real engine and a scripted modem:
+// results, channel flags, the init sweep and the modem chosen per call.
+#include <gtest/gtest.h>
+#include <host/log_capture.h>
+
+#include <fstream>
+
+#include "ZerbSimSecureElement.h"
+#include "engine_fixture.h"
+
+namespace {
+
+using android::sp;
+using android::hardware::hidl_vec;
+using android::hardware::Return;
+using android::hardware::Void;
+using android::hardware::secure_element::V1_0::ISecureElementHalCallback;
+using android::hardware::secure_element::V1_0::LogicalChannelResponse;
+using android::hardware::secure_element::V1_0::SecureElementStatus;
+using android::hardware::secure_element::V1_0::implementation::ZerbSimSecureElement;
+using android::host::LogCapture;
+using sim_test::finalLine;
+using sim_test::okLine;
+using sim_test::scriptOf;
+using sim_test::waitUntil;
+
+constexpr const char* kTag = "ZerbSimSecureElement";
+
+struct StateCallback : public ISecureElementHalCallback {
+  Return<void> onStateChange(bool connected) override {
+    states.push_back(connected);
+    return Void();
+  }
+  std::vector<bool> states;  // called on the caller's thread, inside init
+};
+
+struct OpenResult {
+  LogicalChannelResponse response;
+  SecureElementStatus status = SecureElementStatus::UNSUPPORTED_OPERATION;
+  int calls = 0;
+};
+
+class Front : public sim_test::EngineTest {
+ protected:
+  void SetUp() override {
+    EngineTest::SetUp();
+    se_ = sp<ZerbSimSecureElement>::make(0);
+  }
+  void initAndWait(int modems = 1) {
+    callback_ = sp<StateCallback>::make();
+    se_->init(callback_);
+    ASSERT_EQ(std::vector<bool>{true}, callback_->states);
+    for (int m = 0; m < modems; m++) {
+      ASSERT_TRUE(waitUntil([m] { return atPortOpened[m] == 1; }));
+    }
+  }
+  OpenResult open(const std::vector<uint8_t>& aid, uint8_t p2) {
+    OpenResult r;
+    se_->openLogicalChannel(aid, p2, [&](const LogicalChannelResponse& resp, SecureElementStatus s) {
+      r.response = resp;
+      r.status = s;
+      r.calls++;
+    });
+    return r;
+  }
+  std::vector<uint8_t> transmit(const std::vector<uint8_t>& apdu) {
+    std::vector<uint8_t> out;
+    int calls = 0;
+    se_->transmit(apdu, [&](const hidl_vec<uint8_t>& resp) {
+      out.assign(resp.begin(), resp.end());
+      calls++;
+    });
+    EXPECT_EQ(1, calls);
+    return out;
+  }
+  std::vector<uint8_t> atr() {
+    std::vector<uint8_t> out;
+    int calls = 0;
+    se_->getAtr([&](const hidl_vec<uint8_t>& resp) {
+      out.assign(resp.begin(), resp.end());
+      calls++;
+    });
+    EXPECT_EQ(1, calls);
+    return out;
+  }
+
+  sp<ZerbSimSecureElement> se_;
+  sp<StateCallback> callback_;
+};
+
+TEST_F(Front, EverythingFailsUntilAnInitWithCallback) {
+  LogCapture cap;
+  se_->init(nullptr);
+  EXPECT_TRUE(cap.contains("init, clientCallback is NULL", kTag));
+  EXPECT_EQ(0, asyncCmdInited[0]);
+
+  EXPECT_FALSE(se_->isCardPresent());
+  EXPECT_TRUE(atr().empty());
+  EXPECT_TRUE(transmit({0x00, 0xA4, 0x04, 0x00}).empty());
+  OpenResult r = open({0xA0, 0x00}, 0);
+  EXPECT_EQ(1, r.calls);
+  EXPECT_EQ(SecureElementStatus::FAILED, r.status);
+  EXPECT_EQ(0, r.response.channelNumber);
+  EXPECT_EQ(SecureElementStatus::FAILED, static_cast<SecureElementStatus>(se_->closeChannel(1)));
+  EXPECT_EQ(5u, cap.find("asyncCmdPush, atPortOpened[0] not open", "QvAtChannel").size());
+  EXPECT_TRUE(modem0_->commands().empty());
+  EXPECT_TRUE(cap.contains("isCardPresent, modem_id: 0", kTag));
+}
+
+TEST_F(Front, OperationsTurnAnswersIntoResults) {
+  initAndWait();
+  modem0_->setScript(scriptOf({{"AT^CARDTYPE?", okLine("^CARDTYPE: 1,1,0")},
+                               {"AT^CARDATR", okLine("^CARDATR: \"3B9F\"")},
+                               {"AT+CCHO=", okLine("+CCHO: 257")},
+                               {"AT+CGLA=257,", okLine("+CGLA: 4,\"9000\"")},
+                               {"AT+CSIM=", okLine("+CSIM: 4,\"6A82\"")},
+                               {"AT+CCHC=", finalLine("OK")}}));
+  LogCapture cap;
+  EXPECT_TRUE(se_->isCardPresent());
+  EXPECT_EQ((std::vector<uint8_t>{0x3B, 0x9F}), atr());
+  EXPECT_TRUE(cap.contains("getAtr, now copy data, modem_id: 0", kTag));
+
+  OpenResult r = open({0xA0, 0x00, 0x01}, 0x7F);
+  EXPECT_EQ(SecureElementStatus::SUCCESS, r.status);
+  EXPECT_EQ(1, r.response.channelNumber);
+  EXPECT_EQ((std::vector<uint8_t>{0x90, 0x00}),
+            std::vector<uint8_t>(r.response.selectResponse.begin(), r.response.selectResponse.end()));
+  EXPECT_EQ(1, g_simOpenedChannels[1]);
+
+  EXPECT_EQ((std::vector<uint8_t>{0x6A, 0x82}), transmit({0x00, 0xB0, 0x00, 0x00, 0x02}));
+  EXPECT_EQ((std::vector<uint8_t>{0x90, 0x00}), transmit({0x01, 0xB0, 0x00, 0x00}));
+
+  // Failures come back as an empty vector.
+  cap.clear();
+  EXPECT_TRUE(transmit({}).empty());
+  EXPECT_TRUE(cap.contains("request_transmit_apdu, datalen 0 is invalid", "QvAtChannel"));
+  EXPECT_TRUE(transmit(std::vector<uint8_t>(264, 0)).empty());
+  EXPECT_TRUE(cap.contains("asyncCmdPush, datalen: 264 is invalid", "QvAtChannel"));
+  EXPECT_TRUE(transmit({0x02, 0xB0, 0x00, 0x00}).empty());  // channel 2 not open
+
+  EXPECT_EQ(SecureElementStatus::SUCCESS, static_cast<SecureElementStatus>(se_->closeChannel(1)));
+  EXPECT_EQ(0, g_simOpenedChannels[1]);
+  EXPECT_EQ("AT+CCHC=257", modem0_->commands().back());
+  // A close of a channel never opened is still sent, and fails.
+  EXPECT_EQ(SecureElementStatus::FAILED, static_cast<SecureElementStatus>(se_->closeChannel(1)));
+  cap.clear();
+  g_simOpenedChannels[4] = 1;
+  EXPECT_EQ(SecureElementStatus::FAILED, static_cast<SecureElementStatus>(se_->closeChannel(200)));
+  EXPECT_TRUE(cap.contains("request_close_logical_channel, channel 200 is invalid", "QvAtChannel"));
+  EXPECT_EQ(1, g_simOpenedChannels[4]);
+}
+
+TEST_F(Front, OpenLogicalChannelResults) {
+  initAndWait();
+  struct Case {
+    const char* name;
+    std::string open;
+    std::string select;
+    SecureElementStatus status;
+    uint8_t channel;
+    std::vector<uint8_t> selectResponse;
+  };
+  const Case cases[] = {
+      {"select response", okLine("+CCHP: 259"), okLine("+CGLA: 6,\"6F9000\""),
+       SecureElementStatus::SUCCESS, 3, {0x6F, 0x90, 0x00}},
+      {"empty select response", okLine("+CCHP: 260"), okLine("+CGLA: 0,\"\""),
+       SecureElementStatus::SUCCESS, 4, {}},
+      {"malformed select response", okLine("+CCHP: 261"), okLine("+CGLA: 3,\"900\""),
+       SecureElementStatus::SUCCESS, 5, {}},
+      {"no such applet", finalLine("+CME ERROR: 716"), "", SecureElementStatus::NO_SUCH_ELEMENT_ERROR,
+       0, {}},
+      {"no channel free", finalLine("+CME ERROR: 717"), "", SecureElementStatus::CHANNEL_NOT_AVAILABLE,
+       0, {}},
+      {"card error", finalLine("+CME ERROR: 760"), "", SecureElementStatus::IOERROR, 0, {}},
+      {"select refused", okLine("+CCHP: 262"), finalLine("ERROR"), SecureElementStatus::FAILED, 0, {}},
+  };
+  for (const Case& c : cases) {
+    SCOPED_TRACE(c.name);
+    modem0_->setScript(scriptOf({{"AT+CCHP=", c.open}, {"AT+CGLA=", c.select},
+                                 {"AT+CCHC=", finalLine("OK")}}));
+    OpenResult r = open({0xA0, 0x00}, 0x00);
+    EXPECT_EQ(1, r.calls);
+    EXPECT_EQ(c.status, r.status);
+    EXPECT_EQ(c.channel, r.response.channelNumber);
+    EXPECT_EQ(c.selectResponse, std::vector<uint8_t>(r.response.selectResponse.begin(),
+                                                     r.response.selectResponse.end()));
+    if (c.channel != 0) {
+      EXPECT_EQ(1, g_simOpenedChannels[c.channel]);
+    }
+  }
+  EXPECT_EQ(0, g_simOpenedChannels[6]);  // the refused SELECT left no flag
+}
+
+TEST_F(Front, NewInitClosesChannelsThreeToNineteenOnly) {
+  initAndWait();
+  for (int session : {0x101, 0x102, 0x103, 0x113}) {
+    modem0_->setScript(scriptOf({{"AT+CCHP=", okLine("+CCHP: " + std::to_string(session))},
+                                 {"AT+CGLA=", okLine("+CGLA: 4,9000")}}));
+    ASSERT_EQ(SecureElementStatus::SUCCESS, open({0xA0, 0x00}, 0).status);
+  }
+  modem0_->setScript(scriptOf({{"AT+CCHC=", finalLine("OK")}}));
+  modem0_->clearCommands();
+  LogCapture cap;
+  sp<StateCallback> second = sp<StateCallback>::make();
+  se_->init(second);
+  EXPECT_EQ((std::vector<std::string>{"AT+CCHC=259", "AT+CCHC=275"}), modem0_->commands());
+  EXPECT_EQ(std::vector<bool>{true}, second->states);
+  EXPECT_EQ(1, g_simOpenedChannels[1]);
+  EXPECT_EQ(1, g_simOpenedChannels[2]);
+  EXPECT_EQ(0, g_simOpenedChannels[3]);
+  EXPECT_EQ(0, g_simOpenedChannels[19]);
+  EXPECT_EQ(2u, cap.find("closeChannel, modem_id: 0", kTag).size());
+  // The worker is not started a second time.
+  EXPECT_FALSE(cap.contains("asyncCmdInit, devpath", "QvAtChannel"));
+}
+
+TEST_F(Front, InitLogsAndSettlingDelay) {
+  double uptime = 0;
+  std::ifstream("/proc/uptime") >> uptime;
+  LogCapture cap;
+  initAndWait();
+  EXPECT_TRUE(cap.contains("init, m_modem_id: 0", kTag));
+  EXPECT_TRUE(cap.contains("init, dual_sim = 1", kTag));
+  EXPECT_TRUE(cap.contains("init, m0 init_at_channel SUCCESS", kTag));
+  EXPECT_FALSE(cap.contains("dual_sim init second pthread", kTag));
+  EXPECT_TRUE(cap.contains("print_system_boot_time, time is ", kTag));
+  if (uptime >= 121) {
+    EXPECT_EQ(1, timeflag);
+    EXPECT_FALSE(cap.contains("init, SLEEP 1.5S", kTag));
+    // Once set, a later init does not look at the uptime again.
+    cap.clear();
+    se_->init(sp<StateCallback>::make());
+    EXPECT_FALSE(cap.contains("print_system_boot_time", kTag));
+  } else if (uptime > 0 && uptime < 119) {
+    EXPECT_EQ(-1, timeflag);
+    EXPECT_TRUE(cap.contains("init, SLEEP 1.5S", kTag));
+  }
+}
+
+TEST_F(Front, EachCallGoesToTheModemOfTheSwitchedSim) {
+  startModem1();
+  root_.writeFile("properties", "ro.odm.config.modem_number=2\n");
+  for (const char* node : {"nfc_sim_switch", "nfc_card_num", "nfc_wired_ese_type"}) {
+    root_.writeFile(std::string("sys/nfc/") + node, "0");
+  }
+  LogCapture cap;
+  initAndWait(2);
+  EXPECT_TRUE(cap.contains("init, dual_sim init second pthread", kTag));
+  EXPECT_TRUE(cap.contains("init, m1 init_at_channel SUCCESS", kTag));
+  const auto script = scriptOf({{"AT^CARDTYPE?", okLine("^CARDTYPE: 1,1,0")}});
+  modem0_->setScript(script);
+  modem1_->setScript(scriptOf({{"AT^CARDTYPE?", okLine("^CARDTYPE: 1,0,0")}}));
+
+  EXPECT_TRUE(se_->isCardPresent());
+  EXPECT_EQ(1u, modem0_->commands().size());
+  EXPECT_TRUE(modem1_->commands().empty());
+
+  root_.writeFile("sys/nfc/nfc_sim_switch", "2");
+  root_.writeFile("sys/nfc/nfc_card_num", "3");
+  EXPECT_FALSE(se_->isCardPresent());  // modem 1's card answers "absent"
+  EXPECT_EQ(1u, modem0_->commands().size());
+  EXPECT_EQ(1u, modem1_->commands().size());
+  EXPECT_TRUE(cap.contains("isCardPresent, modem_id: 1", kTag));
+
+  root_.appendFile("properties", "persist.odm.radio.sim_slot_cfg=1,0\n");
+  EXPECT_TRUE(se_->isCardPresent());
+  EXPECT_EQ(2u, modem0_->commands().size());
+
+  // No answer from the selection: modem 0 with an error line.
+  root_.appendFile("properties", "persist.odm.radio.sim_slot_cfg=0\n");
+  cap.clear();
+  EXPECT_TRUE(se_->isCardPresent());
+  EXPECT_TRUE(cap.contains("isCardPresent, modem_id error: -1", kTag));
+  EXPECT_EQ(3u, modem0_->commands().size());
+}
+
+}  // namespace
