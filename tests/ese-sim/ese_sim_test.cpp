@@ -5,6 +5,7 @@
 #include <unistd.h>
 
 #include <cstring>
+#include <thread>
 #include <filesystem>
 #include <fstream>
 #include <string>
@@ -269,6 +270,34 @@ TEST_F(EseSimTest, MalformedRecordsAreRefused) {
   phQvEse_data out{0, nullptr};
   EXPECT_NE(phQVNciHal_Transmit_APDU_by_IPC(&in, &out), 0);
   EXPECT_EQ(out.len, 0u);
+}
+
+// The daemon calls init and serviceDied (open, close) without its lock while
+// a transmit may run: each exchange still sees either a closed eSE (no bytes)
+// or a whole card answer.
+TEST_F(EseSimTest, OpenAndCloseBesideExchanges) {
+  ASSERT_EQ(phQvEse_init_open(), 0);
+  std::thread opener([] {
+    for (int i = 0; i < 200; ++i) {
+      phQvEse_close();
+      phQvEse_init_open();
+    }
+  });
+  for (int i = 0; i < 400; ++i) {
+    uint8_t cmd[] = {0x00, 0xCA, 0x00, 0x66, 0x00};
+    uint8_t buf[270];
+    memset(buf, 0, sizeof(buf));
+    phQvEse_data in{sizeof(cmd), cmd};
+    phQvEse_data rsp{0, buf};
+    if (phQVNciHal_Transmit_APDU_by_IPC(&in, &rsp) == 0) {
+      ASSERT_EQ(rsp.len, 10u);
+      EXPECT_EQ(buf[8], 0x90);
+    } else {
+      EXPECT_EQ(rsp.len, 0u);
+    }
+  }
+  opener.join();
+  EXPECT_EQ(phQvEse_init_open(), 0);
 }
 
 }  // namespace
