@@ -32,9 +32,13 @@ enum {
   REQUEST_CLOSE_LOGICAL_CHANNEL = 6,
 };
 
+// `modem_id` and `state` are atomic: both workers test them in their wait
+// while a caller fills the record under the other modem's mutex. The other
+// fields are touched only by the caller and by the worker the request is for,
+// handed over under that worker's mutex.
 struct AsyncCmdRecord {
-  int32_t modem_id;
-  int32_t state;
+  std::atomic<int32_t> modem_id;
+  std::atomic<int32_t> state;
   int32_t request;
   int32_t param;
   int32_t datalen;
