@@ -244,12 +244,15 @@ class Modem {
     }
   }
 
-  // Closing the master drops what the client has not read yet: give it up
-  // to a second to take the last answer first.
+  // Closing the master drops what the client has not read yet. The pty moves
+  // written bytes to the slave side asynchronously, so an empty queue right
+  // after the write proves nothing: allow 100 ms, then wait (up to a second)
+  // until the client has taken everything.
   void awaitDrained() {
     for (int i = 0; i < 200 && !g_stop && slave_ >= 0; ++i) {
       int pending = 0;
-      if (ioctl(slave_, FIONREAD, &pending) != 0 || pending == 0) return;
+      if (ioctl(slave_, FIONREAD, &pending) != 0) return;
+      if (pending == 0 && i >= 20) return;
       sleepMs(5);
     }
   }
