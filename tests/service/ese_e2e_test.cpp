@@ -17,7 +17,6 @@
 #include <fstream>
 #include <memory>
 #include <mutex>
-#include <regex>
 #include <stdexcept>
 #include <string>
 #include <thread>
@@ -206,13 +205,21 @@ class SecliSession {
   size_t pos_ = 0;
 };
 
+// The value of `name` in one flat JSON object, quotes removed.
 std::string field(const std::string& json, const std::string& name) {
-  std::smatch m;
-  const std::regex quoted("\"" + name + "\":\"([^\"]*)\"");
-  if (std::regex_search(json, m, quoted)) return m[1];
-  const std::regex bare("\"" + name + "\":([^,}]*)");
-  if (std::regex_search(json, m, bare)) return m[1];
-  return "(no " + name + " in " + json + ")";
+  const std::string key = "\"" + name + "\":";
+  const size_t at = json.find(key);
+  if (at == std::string::npos) return "(no " + name + " in " + json + ")";
+  size_t begin = at + key.size();
+  size_t end;
+  if (begin < json.size() && json[begin] == '"') {
+    ++begin;
+    end = json.find('"', begin);
+  } else {
+    end = json.find_first_of(",}", begin);
+  }
+  if (end == std::string::npos) return "(bad " + name + " in " + json + ")";
+  return json.substr(begin, end - begin);
 }
 
 std::string hexByte(int v) {
