@@ -66,6 +66,7 @@ class Process {
       kill(pid_, sig);
       waitpid(pid_, &status_, 0);
       reaped_ = true;
+      waitEof(kGenerousMs);  // everything it wrote is in text() now
     }
     return status_;
   }
@@ -189,6 +190,12 @@ class SimEndToEnd : public ::testing::Test {
     // The daemon first, so that no port is in use when the modems go.
     if (daemon_) daemon_->stop(SIGKILL);
     for (auto& m : modems_) m->stop(SIGTERM);
+    // In sanitizer builds the daemon reports problems on its output and goes on.
+    if (daemon_) {
+      for (const char* report : {"ThreadSanitizer", "AddressSanitizer", "runtime error"}) {
+        EXPECT_EQ(std::string::npos, daemon_->text().find(report)) << report;
+      }
+    }
     if (HasFailure() && daemon_) std::cerr << "daemon output:\n" << daemon_->text();
   }
 
