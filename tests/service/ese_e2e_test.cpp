@@ -32,6 +32,15 @@ constexpr const char* kBigAid = "A00000000102";
 constexpr const char* kP2Aid = "A00000000103";
 constexpr const char* kMissingAid = "A00000000199";
 
+// A sanitizer build reports into the process's standard error and may keep
+// running; such a report fails the test.
+void expectNoSanitizerReport(const std::string& who, const std::string& err) {
+  for (const char* mark : {"ERROR: AddressSanitizer", "ERROR: LeakSanitizer",
+                           "WARNING: ThreadSanitizer", "runtime error:"}) {
+    EXPECT_EQ(err.find(mark), std::string::npos) << who << ":\n" << err;
+  }
+}
+
 // Collects everything a child writes to one pipe; waits are on a condition
 // the reader thread signals, never on a clock alone.
 class PipeReader {
@@ -199,6 +208,11 @@ class SecliSession {
     return line;
   }
   Child& child() { return child_; }
+  ~SecliSession() {
+    child_.closeStdin();
+    child_.err().waitEof();
+    expectNoSanitizerReport("secli", child_.err().text());
+  }
 
  private:
   Child child_;
@@ -231,6 +245,8 @@ std::string hexByte(int v) {
 class EseEndToEnd : public ::testing::Test {
  protected:
   void SetUp() override {
+    // A child that dies early must not take the test with it on the next write.
+    signal(SIGPIPE, SIG_IGN);
     char tmpl[] = "/tmp/ese_e2e.XXXXXX";
     ASSERT_NE(mkdtemp(tmpl), nullptr);
     root = tmpl;
@@ -239,6 +255,7 @@ class EseEndToEnd : public ::testing::Test {
     if (daemon && HasFailure()) {
       fprintf(stderr, "---- daemon log ----\n%s---- end ----\n", daemon->err().text().c_str());
     }
+    if (daemon) expectNoSanitizerReport("daemon", daemon->err().text());
     daemon.reset();
     const std::string rm = "rm -rf '" + root + "'";
     if (system(rm.c_str()) != 0) fprintf(stderr, "could not remove %s\n", root.c_str());
@@ -260,6 +277,7 @@ class EseEndToEnd : public ::testing::Test {
     c.closeStdin();
     const int rc = c.waitExit();
     *out = c.out().text();
+    expectNoSanitizerReport("secli", c.err().text());
     return rc;
   }
 
