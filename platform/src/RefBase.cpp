@@ -37,9 +37,10 @@ void RefBase::incStrong(const void* id) const {
 
 void RefBase::decStrong(const void* id) const {
   weakref_impl* refs = mRefs;
-  int32_t c = refs->mStrong.fetch_sub(1, std::memory_order_release);
+  // acq_rel on the decrement itself rather than a separate acquire fence:
+  // the thread sanitizer does not model stand-alone fences.
+  int32_t c = refs->mStrong.fetch_sub(1, std::memory_order_acq_rel);
   if (c == 1) {
-    std::atomic_thread_fence(std::memory_order_acquire);
     const_cast<RefBase*>(this)->onLastStrongRef(id);
     delete this;
   }
@@ -65,9 +66,8 @@ void RefBase::weakref_type::incWeak(const void*) {
 
 void RefBase::weakref_type::decWeak(const void*) {
   auto* impl = static_cast<weakref_impl*>(this);
-  int32_t c = impl->mWeak.fetch_sub(1, std::memory_order_release);
+  int32_t c = impl->mWeak.fetch_sub(1, std::memory_order_acq_rel);
   if (c != 1) return;
-  std::atomic_thread_fence(std::memory_order_acquire);
   int32_t strong = impl->mStrong.load(std::memory_order_relaxed);
   // The object is gone (strong reached zero) or was never strongly held and
   // its last weak reference goes now: in both cases nothing else owns the
