@@ -34,6 +34,19 @@ namespace {
 
 pthread_attr_t asyncCmdAttr[ASYNC_CMD_MODEM_MAX];
 
+// init runs without the front's lock and may come from two RPC threads at
+// once: the check and the start of a worker must be one step, or a modem
+// could get two workers fighting over its port.
+pthread_mutex_t g_initLock = PTHREAD_MUTEX_INITIALIZER;
+
+class InitLock {
+ public:
+  InitLock() { pthread_mutex_lock(&g_initLock); }
+  ~InitLock() { pthread_mutex_unlock(&g_initLock); }
+  InitLock(const InitLock&) = delete;
+  InitLock& operator=(const InitLock&) = delete;
+};
+
 const char* const kDevPath[ASYNC_CMD_MODEM_MAX] = {MODEM0_AT_DEV_PATH, MODEM1_AT_DEV_PATH};
 
 constexpr int kOpenTryCount = 5;
@@ -60,6 +73,7 @@ int hexNibble(char c) {
 
 int32_t init_at_channel(int32_t modem_id) {
   if (!validModem(modem_id)) return -1;
+  InitLock lock;
   if (asyncCmdInited[modem_id] == 1) return 0;
   const char* path = kDevPath[modem_id];
   QV_LOGI("%s, devpath: %s", "asyncCmdInit", path);

@@ -613,33 +613,4 @@ TEST(EnginePort, DoesNotBecomeControllingTerminal) {
   EXPECT_EQ(0, WEXITSTATUS(status));
 }
 
-TEST(HexCodec, EncodeAndDecode) {
-  char text[8];
-  const uint8_t bytes[] = {0x00, 0xAF, 0x1b};
-  EXPECT_EQ(6, hexEncode(bytes, 3, text, sizeof(text)));
-  EXPECT_STREQ("00AF1B", text);
-  EXPECT_EQ(-1, hexEncode(bytes, 4, text, 8));  // needs 9 with the NUL
-  EXPECT_EQ(0, hexEncode(bytes, 0, text, 1));
-  EXPECT_STREQ("", text);
-
-  uint8_t out[4] = {0};
-  struct Case {
-    const char* text;
-    int32_t n;
-    int32_t result;
-  };
-  const Case cases[] = {{"aF09", 4, 2}, {"aF09", 3, -1}, {"aF09", -2, -1}, {nullptr, 2, -1},
-                        {"", 0, 0},     {"0g", 2, -1},   {"g0", 2, -1},   {"0102030405", 10, -1}};
-  for (const Case& c : cases) {
-    SCOPED_TRACE(c.text ? c.text : "(null)");
-    EXPECT_EQ(c.result, hexDecode(c.text, c.n, out, sizeof(out)));
-  }
-  EXPECT_EQ(2, hexDecode("aF09", 4, out, sizeof(out)));
-  EXPECT_EQ(0xAF, out[0]);
-  EXPECT_EQ(0x09, out[1]);
-  out[1] = 0;
-  EXPECT_EQ(-1, hexDecode("7Ex1", 4, out, sizeof(out)));
-  EXPECT_EQ(0x7E, out[0]);  // bytes before the bad pair stay
-}
-
 }  // namespace
