@@ -1,0 +1,654 @@
+// The channel over real descriptor pairs, with a scripted modem thread on
+// the far end. The test's own thread opens the channel and sends on it.
+#include <fcntl.h>
+#include <gtest/gtest.h>
+#include <host/log_capture.h>
+#include <poll.h>
+#include <signal.h>
+#include <stdlib.h>
+#include <sys/socket.h>
+#include <termios.h>
+#include <unistd.h>
+
+#include <atomic>
+#include <chrono>
+#include <condition_variable>
+#include <cstring>
+#include <functional>
+#include <mutex>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "at_tok.h"
+#include "atchannel.h"
+#include "se_delay.h"
+
+namespace {
+
+using Clock = std::chrono::steady_clock;
+using std::chrono::milliseconds;
+constexpr milliseconds kGenerous(10000);
+
+// Polls a condition that has no event of its own (log records) until a
+// generous deadline.
+bool eventually(const std::function<bool()>& pred, milliseconds limit = kGenerous) {
+  auto end = Clock::now() + limit;
+  while (Clock::now() < end) {
+    if (pred()) return true;
+    std::this_thread::sleep_for(milliseconds(2));
+  }
+  return pred();
+}
+
+size_t countLogs(const android::host::LogCapture& cap, const std::string& text) {
+  return cap.find(text, "atchannel").size();
+}
+
+// What the unsolicited handler saw, and an optional action it runs.
+struct Unsol {
+  std::mutex m;
+  std::condition_variable cv;
+  std::vector<std::pair<std::string, std::string>> lines;  // pdu "-" when none
+  std::function<void(const std::string&)> hook;
+
+  void reset() {
+    std::lock_guard<std::mutex> g(m);
+    lines.clear();
+    hook = nullptr;
+  }
+  bool waitFor(const std::string& line, milliseconds limit = kGenerous) {
+    std::unique_lock<std::mutex> g(m);
+    return cv.wait_for(g, limit, [&] {
+      for (auto& l : lines) {
+        if (l.first == line) return true;
+      }
+      return false;
+    });
+  }
+  bool waitCount(size_t n, milliseconds limit = kGenerous) {
+    std::unique_lock<std::mutex> g(m);
+    return cv.wait_for(g, limit, [&] { return lines.size() >= n; });
+  }
+  std::vector<std::pair<std::string, std::string>> snapshot() {
+    std::lock_guard<std::mutex> g(m);
+    return lines;
+  }
+};
+Unsol g_unsol;
+
+void onUnsol(const char* s, const char* pdu) {
+  std::function<void(const std::string&)> hook;
+  {
+    std::lock_guard<std::mutex> g(g_unsol.m);
+    g_unsol.lines.emplace_back(s, pdu ? pdu : "-");
+    hook = g_unsol.hook;
+  }
+  g_unsol.cv.notify_all();
+  if (hook) hook(s);
+}
+
+// The modem end: reads commands (ended by CR), records them and lets the
+// test's script answer each one.
+class FakeModem {
+ public:
+  using Script = std::function<void(FakeModem&, const std::string&)>;
+
+  static std::unique_ptr<FakeModem> socketPair() {
+    int sv[2];
+    if (socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, sv) != 0) return nullptr;
+    return std::unique_ptr<FakeModem>(new FakeModem(sv[1], sv[0]));
+  }
+  static std::unique_ptr<FakeModem> pty() {
+    int master = posix_openpt(O_RDWR | O_NOCTTY | O_CLOEXEC);
+    if (master < 0 || grantpt(master) != 0 || unlockpt(master) != 0) return nullptr;
+    int slave = open(ptsname(master), O_RDWR | O_NOCTTY | O_CLOEXEC);
+    if (slave < 0) return nullptr;
+    struct termios t;
+    tcgetattr(slave, &t);
+    cfmakeraw(&t);
+    tcsetattr(slave, TCSANOW, &t);
+    return std::unique_ptr<FakeModem>(new FakeModem(master, slave));
+  }
+
+  ~FakeModem() {
+    char c = 1;
+    ssize_t n = write(stop_[1], &c, 1);
+    (void)n;
+    if (thread_.joinable()) thread_.join();
+    close(fd_);
+    close(stop_[0]);
+    close(stop_[1]);
+  }
+
+  // The channel's end; at_open takes it over.
+  int portFd() const { return port_; }
+  void start(Script script) {
+    script_ = std::move(script);
+    thread_ = std::thread([this] { run(); });
+  }
+  void send(const std::string& bytes) {
+    size_t done = 0;
+    while (done < bytes.size()) {
+      ssize_t n = write(fd_, bytes.data() + done, bytes.size() - done);
+      if (n < 0 && errno == EINTR) continue;
+      if (n <= 0) return;
+      done += static_cast<size_t>(n);
+    }
+  }
+  void shutdownWrite() { shutdown(fd_, SHUT_WR); }
+  std::vector<std::string> commands() {
+    std::lock_guard<std::mutex> g(m_);
+    return commands_;
+  }
+  std::string raw() {
+    std::lock_guard<std::mutex> g(m_);
+    return raw_;
+  }
+  bool waitCommands(size_t n, milliseconds limit = kGenerous) {
+    std::unique_lock<std::mutex> g(m_);
+    return cv_.wait_for(g, limit, [&] { return commands_.size() >= n; });
+  }
+  // True once the channel's end has been closed.
+  bool waitHangup(milliseconds limit = kGenerous) {
+    std::unique_lock<std::mutex> g(m_);
+    return cv_.wait_for(g, limit, [&] { return hungUp_; });
+  }
+
+ private:
+  FakeModem(int fd, int port) : fd_(fd), port_(port) {
+    if (pipe2(stop_, O_CLOEXEC) != 0) abort();
+  }
+
+  void run() {
+    std::string pending;
+    for (;;) {
+      struct pollfd pfd[2] = {{fd_, POLLIN, 0}, {stop_[0], POLLIN, 0}};
+      if (poll(pfd, 2, -1) < 0) {
+        if (errno == EINTR) continue;
+        return;
+      }
+      if (pfd[1].revents != 0) return;
+      char buf[4096];
+      ssize_t n = read(fd_, buf, sizeof(buf));
+      if (n <= 0) {
+        {
+          std::lock_guard<std::mutex> g(m_);
+          hungUp_ = true;
+        }
+        cv_.notify_all();
+        // Keep waiting only for the stop signal.
+        struct pollfd s = {stop_[0], POLLIN, 0};
+        poll(&s, 1, -1);
+        return;
+      }
+      pending.append(buf, static_cast<size_t>(n));
+      {
+        std::lock_guard<std::mutex> g(m_);
+        raw_.append(buf, static_cast<size_t>(n));
+      }
+      size_t cr;
+      while ((cr = pending.find('\r')) != std::string::npos) {
+        std::string cmd = pending.substr(0, cr);
+        pending.erase(0, cr + 1);
+        {
+          std::lock_guard<std::mutex> g(m_);
+          commands_.push_back(cmd);
+        }
+        cv_.notify_all();
+        if (script_) script_(*this, cmd);
+      }
+    }
+  }
+
+  int fd_;
+  int port_;
+  int stop_[2];
+  Script script_;
+  std::thread thread_;
+  std::mutex m_;
+  std::condition_variable cv_;
+  std::vector<std::string> commands_;
+  std::string raw_;
+  bool hungUp_ = false;
+};
+
+struct ResponseDeleter {
+  void operator()(ATResponse* r) const { at_response_free(r); }
+};
+using ResponsePtr = std::unique_ptr<ATResponse, ResponseDeleter>;
+
+std::vector<std::string> intermediates(const ATResponse* r) {
+  std::vector<std::string> out;
+  for (const ATResponseLine* l = r->p_intermediates; l != nullptr; l = l->next) out.push_back(l->text);
+  return out;
+}
+
+class Channel : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    signal(SIGPIPE, SIG_IGN);
+    se_delay::setDivisorForTest(1);
+    g_unsol.reset();
+    g_ulModemId = 0;
+  }
+  void TearDown() override {
+    at_close();
+    modem_.reset();
+    se_delay::setDivisorForTest(1);
+  }
+  // Opens the channel on this thread over a socket pair answered by `script`.
+  void open(FakeModem::Script script, std::unique_ptr<FakeModem> modem = FakeModem::socketPair()) {
+    modem_ = std::move(modem);
+    ASSERT_TRUE(modem_);
+    fd_ = modem_->portFd();
+    modem_->start(std::move(script));
+    ASSERT_EQ(at_open(fd_, onUnsol, 0), 0);
+  }
+  std::string tagged(const char* dir, const std::string& rest) {
+    return "m0_" + std::to_string(fd_) + dir + rest;
+  }
+
+  android::host::LogCapture cap_;
+  std::unique_ptr<FakeModem> modem_;
+  int fd_ = -1;
+};
+
+FakeModem::Script answer(const std::string& reply) {
+  return [reply](FakeModem& m, const std::string&) { m.send(reply); };
+}
+
+TEST_F(Channel, SinglelineExchangeOverSocketAndPty) {
+  for (bool usePty : {false, true}) {
+    SCOPED_TRACE(usePty ? "pty" : "socket pair");
+    open(answer("\r\n^CARDTYPE: 1,1,0\r\n\r\nOK\r\n"),
+         usePty ? FakeModem::pty() : FakeModem::socketPair());
+    ATResponse* raw = nullptr;
+    ASSERT_EQ(at_send_command_singleline("AT^CARDTYPE?", "^CARDTYPE:", &raw), AT_OK);
+    ResponsePtr r(raw);
+    ASSERT_TRUE(r);
+    EXPECT_EQ(r->success, 1);
+    EXPECT_STREQ(r->final_response, "OK");
+    ASSERT_EQ(intermediates(r.get()), std::vector<std::string>{"^CARDTYPE: 1,1,0"});
+    char* cur = r->p_intermediates->text;
+    int32_t a = -1, b = -1, c = -1;
+    ASSERT_EQ(at_tok_start(&cur), 0);
+    EXPECT_EQ(at_tok_nextint(&cur, &a), 0);
+    EXPECT_EQ(at_tok_nextint(&cur, &b), 0);
+    EXPECT_EQ(at_tok_nextint(&cur, &c), 0);
+    EXPECT_EQ(a * 100 + b * 10 + c, 110);
+    EXPECT_EQ(modem_->raw(), "AT^CARDTYPE?\r");
+    EXPECT_EQ(get_ac_index(), 0);
+    EXPECT_TRUE(cap_.contains(tagged(">", "AT^CARDTYPE?\n"), "atchannel"));
+    EXPECT_TRUE(cap_.contains(tagged("<", "^CARDTYPE: 1,1,0\n"), "atchannel"));
+    at_close();
+    EXPECT_TRUE(eventually([&] { return countLogs(cap_, "< reader close.") >= 1; }));
+    cap_.clear();
+  }
+}
+
+TEST_F(Channel, AnswerSplitAcrossReadsAndSeveralLinesInOneRead) {
+  open([](FakeModem& m, const std::string& cmd) {
+    if (cmd.rfind("AT+CCHO=", 0) == 0) {
+      // The reader must have handled the first piece before the rest comes.
+      m.send("+CREG: 1\r\n+CC");
+      g_unsol.waitFor("+CREG: 1");
+      m.send("HO: 7");
+      m.send("\r\n\r\nO");
+      m.send("K\r\n");
+    } else {
+      m.send("+CSIM: 4,\"9000\"\r\nOK\r\n");
+    }
+  });
+  ATResponse* raw = nullptr;
+  ASSERT_EQ(at_send_command_singleline("AT+CCHO=\"A000\"", "+CCHO:", &raw), AT_OK);
+  ResponsePtr r(raw);
+  EXPECT_EQ(intermediates(r.get()), std::vector<std::string>{"+CCHO: 7"});
+  EXPECT_STREQ(r->final_response, "OK");
+
+  ASSERT_EQ(at_send_command_singleline("AT+CSIM=4,\"0070\"", "+CSIM:", &raw), AT_OK);
+  ResponsePtr r2(raw);
+  EXPECT_EQ(intermediates(r2.get()), std::vector<std::string>{"+CSIM: 4,\"9000\""});
+  EXPECT_EQ(r2->success, 1);
+}
+
+TEST_F(Channel, LinesWithoutAPendingCommandAreUnsolicited) {
+  open(nullptr);
+  modem_->send("\r\nOK\r\n+CMT: 5\r\n0891AB\r\n");
+  ASSERT_TRUE(g_unsol.waitCount(2));
+  auto seen = g_unsol.snapshot();
+  EXPECT_EQ(seen[0], std::make_pair(std::string("OK"), std::string("-")));
+  EXPECT_EQ(seen[1], std::make_pair(std::string("+CMT: 5"), std::string("0891AB")));
+  // The second line of a pair is kept out of the log.
+  EXPECT_TRUE(cap_.contains(tagged("<", ": ***"), "atchannel"));
+  EXPECT_FALSE(cap_.contains("0891AB"));
+}
+
+TEST_F(Channel, SecondPrefixedLineIsUnsolicited) {
+  open(answer("^CARDTYPE: 1,1,0\r\n^CARDTYPE: 2,2,2\r\nOK\r\n"));
+  ATResponse* raw = nullptr;
+  ASSERT_EQ(at_send_command_singleline("AT^CARDTYPE?", "^CARDTYPE:", &raw), AT_OK);
+  ResponsePtr r(raw);
+  EXPECT_EQ(intermediates(r.get()), std::vector<std::string>{"^CARDTYPE: 1,1,0"});
+  // Handed out by the reader before the final line.
+  auto seen = g_unsol.snapshot();
+  ASSERT_EQ(seen.size(), 1u);
+  EXPECT_EQ(seen[0].first, "^CARDTYPE: 2,2,2");
+}
+
+TEST_F(Channel, FinalLinesAreCaseSensitivePrefixes) {
+  open(answer("ok\r\nOKAY\r\nOK\r\n"));
+  ATResponse* raw = nullptr;
+  ASSERT_EQ(at_send_command("AT+X", &raw), AT_OK);
+  ResponsePtr r(raw);
+  EXPECT_EQ(r->success, 1);
+  EXPECT_STREQ(r->final_response, "OKAY");
+  // The OK after OKAY arrives with no command pending.
+  ASSERT_TRUE(g_unsol.waitCount(2));
+  auto seen = g_unsol.snapshot();
+  EXPECT_EQ(seen[0].first, "ok");
+  EXPECT_EQ(seen[1].first, "OK");
+}
+
+TEST_F(Channel, ErrorFinalResponses) {
+  struct Case {
+    const char* reply;
+    int32_t rc;
+    int32_t cme;
+  };
+  const Case cases[] = {
+      {"+CME ERROR: 4\r\n", AT_OK, 4},
+      {"ERROR\r\n", AT_OK, -1},
+      {"OK\r\n", AT_ERROR_INVALID_RESPONSE, -1},
+  };
+  std::string reply;
+  std::mutex m;
+  open([&](FakeModem& fm, const std::string&) {
+    std::lock_guard<std::mutex> g(m);
+    fm.send(reply);
+  });
+  for (const Case& c : cases) {
+    {
+      std::lock_guard<std::mutex> g(m);
+      reply = c.reply;
+    }
+    ATResponse* raw = reinterpret_cast<ATResponse*>(0x1);  // must be overwritten
+    int32_t rc = at_send_command_singleline("AT+CCHO=\"A0\"", "+CCHO:", &raw);
+    ResponsePtr r(raw);
+    EXPECT_EQ(rc, c.rc) << c.reply;
+    if (c.rc == AT_ERROR_INVALID_RESPONSE) {
+      EXPECT_EQ(raw, nullptr);
+      continue;
+    }
+    ASSERT_NE(raw, nullptr);
+    EXPECT_EQ(r->success, 0);
+    EXPECT_EQ(std::string(r->final_response) + "\r\n", c.reply);
+    EXPECT_EQ(r->p_intermediates, nullptr);
+    EXPECT_EQ(at_get_cme_error(r.get()), c.cme);
+  }
+}
+
+TEST_F(Channel, SilentModemTimesOutAndTheLateAnswerIsUnsolicited) {
+  se_delay::setDivisorForTest(1000);  // 600 s become 600 ms
+  open(nullptr);
+  ATResponse* raw = nullptr;
+  auto t0 = Clock::now();
+  EXPECT_EQ(at_send_command_singleline("AT^CARDATR", "^CARDATR:", &raw), AT_ERROR_TIMEOUT);
+  EXPECT_GE(Clock::now() - t0, milliseconds(590));
+  EXPECT_EQ(raw, nullptr);
+  modem_->send("^CARDATR: \"3B00\"\r\nOK\r\n");
+  ASSERT_TRUE(g_unsol.waitFor("OK"));
+  EXPECT_EQ(g_unsol.snapshot()[0].first, "^CARDATR: \"3B00\"");
+}
+
+std::atomic<int> g_timeouts{0};
+void countTimeout() { ++g_timeouts; }
+
+TEST_F(Channel, TimeoutProbe) {
+  se_delay::setDivisorForTest(1000);
+  struct Case {
+    bool answerProbe;
+    int callbacks;
+  };
+  for (const Case& c : {Case{true, 0}, Case{false, 1}}) {
+    SCOPED_TRACE(c.answerProbe ? "probe answered" : "probe silent");
+    g_timeouts = 0;
+    g_ulModemId = 1;
+    cap_.clear();
+    open([c](FakeModem& m, const std::string& cmd) {
+      if (cmd == "AT" && c.answerProbe) m.send("OK\r\n");
+    });
+    at_set_on_timeout(countTimeout);
+    EXPECT_EQ(at_send_command("AT+SLOW", nullptr), AT_ERROR_TIMEOUT);
+    EXPECT_EQ(modem_->commands(), (std::vector<std::string>{"AT+SLOW", "AT"}));
+    EXPECT_EQ(g_timeouts.load(), c.callbacks);
+    EXPECT_EQ(countLogs(cap_, "m1_0< timeout."), static_cast<size_t>(c.callbacks));
+    at_set_on_timeout(nullptr);
+    at_close();
+    modem_.reset();
+  }
+}
+
+TEST_F(Channel, CloseDuringAWaitEndsItWithChannelClosed) {
+  g_unsol.hook = [](const std::string& line) {
+    if (line == "+BYE") at_close();  // runs on the reader thread
+  };
+  open(answer("+BYE\r\n"));
+  ATResponse* raw = nullptr;
+  EXPECT_EQ(at_send_command_singleline("AT^CARDTYPE?", "^CARDTYPE:", &raw), AT_ERROR_CHANNEL_CLOSED);
+  ResponsePtr r(raw);
+  ASSERT_TRUE(r);  // the record is handed over even on a close
+  EXPECT_EQ(r->success, 0);
+  EXPECT_EQ(r->final_response, nullptr);
+  EXPECT_TRUE(modem_->waitHangup());
+  EXPECT_TRUE(eventually([&] { return countLogs(cap_, "< reader close.") == 1; }));
+  EXPECT_TRUE(cap_.contains("Read FD is invalid", "atchannel"));
+
+  // Later commands fail at once without writing.
+  EXPECT_EQ(at_send_command("AT", nullptr), AT_ERROR_CHANNEL_CLOSED);
+  EXPECT_EQ(modem_->commands().size(), 1u);
+  EXPECT_EQ(countLogs(cap_, "writeline error,errno:-3"), 1u);
+}
+
+TEST_F(Channel, ModemHangupDuringAWaitEndsItWithChannelClosed) {
+  se_delay::setDivisorForTest(100);
+  open([](FakeModem& m, const std::string&) { m.shutdownWrite(); });
+  EXPECT_EQ(at_send_command("AT+X", nullptr), AT_ERROR_CHANNEL_CLOSED);
+  EXPECT_TRUE(cap_.contains("atchannel: port stays at end of file", "atchannel"));
+  EXPECT_TRUE(eventually([&] { return countLogs(cap_, "< reader close.") == 1; }));
+}
+
+TEST_F(Channel, CloseWakesABlockedReaderAtOnceAndItNeverReadsTheReusedNumber) {
+  open(nullptr);
+  at_close();
+  // The old port number is free now; take it again at once.
+  int sv[2];
+  ASSERT_EQ(socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, sv), 0);
+  ASSERT_EQ(write(sv[1], "DATA\r\n", 6), 6);
+  auto t0 = Clock::now();
+  ASSERT_TRUE(eventually([&] { return countLogs(cap_, "< reader close.") == 1; }));
+  EXPECT_LT(Clock::now() - t0, milliseconds(2000));
+  EXPECT_TRUE(cap_.contains("[m0][ch:-1] < reader close.", "atchannel"));
+  char buf[16] = {};
+  EXPECT_EQ(recv(sv[0], buf, sizeof(buf), MSG_DONTWAIT), 6);
+  EXPECT_FALSE(cap_.contains("DATA"));
+  close(sv[0]);
+  close(sv[1]);
+}
+
+TEST_F(Channel, ReaderThreadMayNotSend) {
+  std::atomic<int32_t> fromReader{0};
+  std::atomic<int32_t> fromReaderSingle{0};
+  g_unsol.hook = [&](const std::string&) {
+    fromReader = at_send_command("AT", nullptr);
+    ATResponse* r = nullptr;
+    fromReaderSingle = at_send_command_singleline("AT", "+X:", &r);
+    at_response_free(r);
+  };
+  open(nullptr);
+  modem_->send("+RING\r\n");
+  ASSERT_TRUE(g_unsol.waitFor("+RING"));
+  EXPECT_TRUE(eventually([&] { return fromReaderSingle.load() != 0; }));
+  EXPECT_EQ(fromReader.load(), AT_ERROR_INVALID_THREAD);
+  EXPECT_EQ(fromReaderSingle.load(), AT_ERROR_INVALID_THREAD);
+  EXPECT_TRUE(modem_->commands().empty());
+}
+
+TEST_F(Channel, OverlongInputIsDiscardedAndReadingGoesOn) {
+  open(answer("OK\r\n"));
+  modem_->send(std::string(8192, 'A') + "B\r\n");
+  ASSERT_TRUE(g_unsol.waitFor("B"));
+  EXPECT_TRUE(cap_.contains("ERROR: Input line exceeded buffer", "atchannel"));
+  EXPECT_EQ(at_send_command("AT", nullptr), AT_OK);
+}
+
+TEST_F(Channel, FloodOfUnsolicitedLinesWhileACommandWaits) {
+  constexpr int kLines = 3000;
+  open([](FakeModem& m, const std::string&) {
+    std::string flood;
+    for (int i = 0; i < kLines; ++i) flood += "+CREG: " + std::to_string(i) + "\r\n";
+    flood += std::string(50000, 'Z');  // no line end: discarded in buffer-sized bites
+    flood += "\r\n+CGLA: 2,\"90\"\r\n+CGLA: 9,\"XX\"\r\nOK\r\n";
+    m.send(flood);
+  });
+  ATResponse* raw = nullptr;
+  ASSERT_EQ(at_send_command_singleline("AT+CGLA=1,4,\"0000\"", "+CGLA:", &raw), AT_OK);
+  ResponsePtr r(raw);
+  EXPECT_EQ(intermediates(r.get()), std::vector<std::string>{"+CGLA: 2,\"90\""});
+  auto seen = g_unsol.snapshot();
+  ASSERT_GE(seen.size(), static_cast<size_t>(kLines));
+  EXPECT_EQ(seen[kLines - 1].first, "+CREG: " + std::to_string(kLines - 1));
+  EXPECT_EQ(seen.back().first, "+CGLA: 9,\"XX\"");
+}
+
+TEST_F(Channel, SmsPairDoesNotEndThePendingCommand) {
+  open(answer("+CMT: 1\r\nOK\r\n+CCHO: 7\r\nOK\r\n"));
+  ATResponse* raw = nullptr;
+  ASSERT_EQ(at_send_command_singleline("AT+CCHO=\"A0000000031010\"", "+CCHO:", &raw), AT_OK);
+  ResponsePtr r(raw);
+  EXPECT_EQ(intermediates(r.get()), std::vector<std::string>{"+CCHO: 7"});
+  auto seen = g_unsol.snapshot();
+  ASSERT_EQ(seen.size(), 1u);
+  EXPECT_EQ(seen[0], std::make_pair(std::string("+CMT: 1"), std::string("OK")));
+  EXPECT_TRUE(cap_.contains(tagged("<", ": ***\n"), "atchannel"));
+}
+
+TEST_F(Channel, MaskedAndClearLogLines) {
+  struct Case {
+    const char* command;
+    const char* reply;
+    const char* sentLog;  // after "m0_<fd>>"
+    const char* recvLog;  // after "m0_<fd><"
+    const char* secret;   // must appear in no record; null when logged in clear
+  };
+  const Case cases[] = {
+      {"AT+CGLA=1,10,\"00A4040005\"", "+CGLA: 4,\"6F9000\"", "AT+CGLA=***\n", "CGLA: ***\n", "6F9000"},
+      {"AT+CCHO=\"A0000000031010\"", "+CCHO: 7", "AT+CCHO==***\n", "+CCHO: 7\n", "A0000000031010"},
+      {"AT+CSIM=10,\"00B0000011\"", "+CSIM: 4,\"6A82\"", "AT+CSIM==***\n", "CSIM:: ***\n", "00B0000011"},
+      {"AT^CARDATR", "^CARDATR: \"3B9F\"", "AT^CARDATR\n", "^CARDATR: \"3B9F\"\n", nullptr},
+  };
+  std::string reply;
+  std::mutex m;
+  open([&](FakeModem& fm, const std::string&) {
+    std::lock_guard<std::mutex> g(m);
+    fm.send(reply + "\r\nOK\r\n");
+  });
+  for (const Case& c : cases) {
+    {
+      std::lock_guard<std::mutex> g(m);
+      reply = c.reply;
+    }
+    ASSERT_EQ(at_send_command(c.command, nullptr), AT_OK) << c.command;
+    EXPECT_TRUE(cap_.contains(tagged(">", c.sentLog), "atchannel")) << c.command;
+    EXPECT_TRUE(cap_.contains(tagged("<", c.recvLog), "atchannel")) << c.reply;
+    if (c.secret != nullptr) {
+      EXPECT_FALSE(cap_.contains(c.secret)) << c.secret;
+    }
+  }
+}
+
+TEST_F(Channel, SecondOpenOnAThreadReusesItsContext) {
+  open(answer("OK\r\n"));
+  // This thread may already hold a record from an earlier test in the same
+  // process; either way, no further record may be made from here on.
+  const size_t made = countLogs(cap_, "ac is null, will malloc");
+  FakeModem* first = modem_.release();
+  auto second = FakeModem::socketPair();
+  ASSERT_TRUE(second);
+  second->start(answer("OK\r\n"));
+  ASSERT_EQ(at_open(second->portFd(), onUnsol, 1), 0);
+  EXPECT_TRUE(cap_.contains("ac is not null", "atchannel"));
+  EXPECT_EQ(countLogs(cap_, "ac is null, will malloc"), made);
+  EXPECT_EQ(get_ac_index(), 1);
+  EXPECT_TRUE(first->waitHangup());  // the earlier port was let go
+  EXPECT_EQ(at_send_command("AT+ONE", nullptr), AT_OK);
+  EXPECT_EQ(second->commands(), std::vector<std::string>{"AT+ONE"});
+  EXPECT_TRUE(first->commands().empty());
+  delete first;
+
+  // Closed and opened again: the same record serves, commands still work.
+  at_close();
+  modem_ = std::move(second);
+  auto third = FakeModem::socketPair();
+  third->start(answer("OK\r\n"));
+  ASSERT_EQ(at_open(third->portFd(), onUnsol, 0), 0);
+  EXPECT_EQ(at_send_command("AT+TWO", nullptr), AT_OK);
+  EXPECT_EQ(third->commands(), std::vector<std::string>{"AT+TWO"});
+  at_close();
+  EXPECT_EQ(countLogs(cap_, "ac is null, will malloc"), made);
+}
+
+TEST_F(Channel, OpenWithoutAPortEndsTheReaderAndCommandsFail) {
+  ASSERT_EQ(at_open(-1, onUnsol, 1), 0);
+  EXPECT_TRUE(eventually([&] { return countLogs(cap_, "< reader close.") == 1; }));
+  EXPECT_TRUE(cap_.contains("Read FD is invalid", "atchannel"));
+  EXPECT_TRUE(cap_.contains("atchannel: read error", "atchannel"));
+  EXPECT_EQ(at_send_command("AT", nullptr), AT_ERROR_CHANNEL_CLOSED);
+  EXPECT_EQ(at_open(-1, onUnsol, 2), -1);  // only two modem slots
+}
+
+TEST(ChannelWrite, FailingWritesGiveUpAfterFiveAttempts) {
+  android::host::LogCapture cap;
+  se_delay::setDivisorForTest(1000);
+  int p[2];
+  ASSERT_EQ(pipe2(p, O_CLOEXEC), 0);
+  // A pipe's read end reads fine but refuses every write.
+  ASSERT_EQ(at_open(p[0], onUnsol, 0), 0);
+  const std::string sent = "m0_" + std::to_string(p[0]) + ">AT+TEST\n";
+  EXPECT_EQ(at_send_command("AT+TEST", nullptr), AT_ERROR_WRITE_FAILED);
+  EXPECT_EQ(countLogs(cap, sent), 5u);
+  EXPECT_EQ(countLogs(cap, "writeline error,errno:-1"), 5u);
+
+  // With a time-out callback the probe "AT" is tried five times too.
+  g_timeouts = 0;
+  at_set_on_timeout(countTimeout);
+  EXPECT_EQ(at_send_command("AT+TEST", nullptr), AT_ERROR_WRITE_FAILED);
+  EXPECT_EQ(countLogs(cap, "m0_" + std::to_string(p[0]) + ">AT\n"), 5u);
+  EXPECT_EQ(g_timeouts.load(), 1);
+  EXPECT_EQ(countLogs(cap, "m0_0< timeout."), 1u);
+  at_close();
+  close(p[1]);
+  se_delay::setDivisorForTest(1);
+}
+
+TEST(NoContext, OperationsOnAThreadWithoutAPortFail) {
+  android::host::LogCapture cap;
+  int32_t send = 0, single = 0, index = 0;
+  ATResponse* r = reinterpret_cast<ATResponse*>(0x1);
+  std::thread([&] {
+    send = at_send_command("AT", nullptr);
+    single = at_send_command_singleline("AT", "+X:", &r);
+    at_set_on_timeout(countTimeout);
+    index = get_ac_index();
+    at_close();
+  }).join();
+  EXPECT_EQ(send, AT_ERROR_GENERIC);
+  EXPECT_EQ(single, AT_ERROR_GENERIC);
+  EXPECT_EQ(r, nullptr);
+  EXPECT_EQ(index, -1);
+  EXPECT_EQ(countLogs(cap, "getAtContext, m0 ac is NULL"), 5u);
+  EXPECT_EQ(countLogs(cap, "getAtContext return null pointer!"), 4u);
+  EXPECT_EQ(countLogs(cap, "get_ac_index:getAtContext return null pointer!"), 1u);
+}
+
+}  // namespace
