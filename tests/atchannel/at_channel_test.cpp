@@ -57,6 +57,10 @@ struct Unsol {
     lines.clear();
     hook = nullptr;
   }
+  void setHook(std::function<void(const std::string&)> h) {
+    std::lock_guard<std::mutex> g(m);
+    hook = std::move(h);
+  }
   bool waitFor(const std::string& line, milliseconds limit = kGenerous) {
     std::unique_lock<std::mutex> g(m);
     return cv.wait_for(g, limit, [&] {
@@ -258,6 +262,27 @@ FakeModem::Script answer(const std::string& reply) {
   return [reply](FakeModem& m, const std::string&) { m.send(reply); };
 }
 
+// A reply the test changes between commands; shared with the modem thread,
+// which may outlive the test body's locals.
+struct SwitchableReply {
+  struct State {
+    std::mutex m;
+    std::string reply;
+  };
+  std::shared_ptr<State> state = std::make_shared<State>();
+  void set(const std::string& r) {
+    std::lock_guard<std::mutex> g(state->m);
+    state->reply = r;
+  }
+  FakeModem::Script script(const std::string& suffix = "") const {
+    std::shared_ptr<State> st = state;
+    return [st, suffix](FakeModem& fm, const std::string&) {
+      std::lock_guard<std::mutex> g(st->m);
+      fm.send(st->reply + suffix);
+    };
+  }
+};
+
 TEST_F(Channel, SinglelineExchangeOverSocketAndPty) {
   for (bool usePty : {false, true}) {
     SCOPED_TRACE(usePty ? "pty" : "socket pair");
@@ -361,17 +386,10 @@ TEST_F(Channel, ErrorFinalResponses) {
       {"ERROR\r\n", AT_OK, -1},
       {"OK\r\n", AT_ERROR_INVALID_RESPONSE, -1},
   };
-  std::string reply;
-  std::mutex m;
-  open([&](FakeModem& fm, const std::string&) {
-    std::lock_guard<std::mutex> g(m);
-    fm.send(reply);
-  });
+  SwitchableReply reply;
+  open(reply.script());
   for (const Case& c : cases) {
-    {
-      std::lock_guard<std::mutex> g(m);
-      reply = c.reply;
-    }
+    reply.set(c.reply);
     ATResponse* raw = reinterpret_cast<ATResponse*>(0x1);  // must be overwritten
     int32_t rc = at_send_command_singleline("AT+CCHO=\"A0\"", "+CCHO:", &raw);
     ResponsePtr r(raw);
@@ -430,9 +448,9 @@ TEST_F(Channel, TimeoutProbe) {
 }
 
 TEST_F(Channel, CloseDuringAWaitEndsItWithChannelClosed) {
-  g_unsol.hook = [](const std::string& line) {
+  g_unsol.setHook([](const std::string& line) {
     if (line == "+BYE") at_close();  // runs on the reader thread
-  };
+  });
   open(answer("+BYE\r\n"));
   ATResponse* raw = nullptr;
   EXPECT_EQ(at_send_command_singleline("AT^CARDTYPE?", "^CARDTYPE:", &raw), AT_ERROR_CHANNEL_CLOSED);
@@ -477,14 +495,14 @@ TEST_F(Channel, CloseWakesABlockedReaderAtOnceAndItNeverReadsTheReusedNumber) {
 }
 
 TEST_F(Channel, ReaderThreadMayNotSend) {
-  std::atomic<int32_t> fromReader{0};
-  std::atomic<int32_t> fromReaderSingle{0};
-  g_unsol.hook = [&](const std::string&) {
+  static std::atomic<int32_t> fromReader{0};
+  static std::atomic<int32_t> fromReaderSingle{0};
+  g_unsol.setHook([](const std::string&) {
     fromReader = at_send_command("AT", nullptr);
     ATResponse* r = nullptr;
     fromReaderSingle = at_send_command_singleline("AT", "+X:", &r);
     at_response_free(r);
-  };
+  });
   open(nullptr);
   modem_->send("+RING\r\n");
   ASSERT_TRUE(g_unsol.waitFor("+RING"));
@@ -547,17 +565,10 @@ TEST_F(Channel, MaskedAndClearLogLines) {
       {"AT+CSIM=10,\"00B0000011\"", "+CSIM: 4,\"6A82\"", "AT+CSIM==***\n", "CSIM:: ***\n", "00B0000011"},
       {"AT^CARDATR", "^CARDATR: \"3B9F\"", "AT^CARDATR\n", "^CARDATR: \"3B9F\"\n", nullptr},
   };
-  std::string reply;
-  std::mutex m;
-  open([&](FakeModem& fm, const std::string&) {
-    std::lock_guard<std::mutex> g(m);
-    fm.send(reply + "\r\nOK\r\n");
-  });
+  SwitchableReply reply;
+  open(reply.script("\r\nOK\r\n"));
   for (const Case& c : cases) {
-    {
-      std::lock_guard<std::mutex> g(m);
-      reply = c.reply;
-    }
+    reply.set(c.reply);
     ASSERT_EQ(at_send_command(c.command, nullptr), AT_OK) << c.command;
     EXPECT_TRUE(cap_.contains(tagged(">", c.sentLog), "atchannel")) << c.command;
     EXPECT_TRUE(cap_.contains(tagged("<", c.recvLog), "atchannel")) << c.reply;
