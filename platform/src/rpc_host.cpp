@@ -217,10 +217,16 @@ class ServerConn : public RemotePeer, public std::enable_shared_from_this<Server
       abort();
       return;
     }
+    sp<IBase> service;
+    {
+      std::lock_guard<std::mutex> g(mLock);
+      service = mService;
+    }
+    if (service == nullptr) return;  // closed meanwhile
     BodyReader in(f.body);
     BodyWriter out;
     std::string error;
-    StubResult r = mStub(mService, f.code, in, out, shared_from_this(), &error);
+    StubResult r = mStub(service, f.code, in, out, shared_from_this(), &error);
     switch (r) {
       case StubResult::Replied: {
         Frame reply;
@@ -253,24 +259,35 @@ class ServerConn : public RemotePeer, public std::enable_shared_from_this<Server
     return true;
   }
 
-  // The connection ended: wakes waiting calls, hands back the death links.
+  // The connection ended (I/O thread only): wakes waiting calls, closes the
+  // socket and hands back the death links. The service reference goes too:
+  // the service may keep this client's callback proxy, which refers back here.
   std::vector<DeathLink> markClosed() {
     std::vector<DeathLink> links;
     std::map<uint32_t, wp<IBase>> proxies;
+    sp<IBase> service;
     {
       std::lock_guard<std::mutex> g(mLock);
       mClosed = true;
       links.swap(mLinks);
       proxies.swap(mProxies);
+      service = mService;
+      mService = nullptr;
       mCv.notify_all();
     }
+    // Unblocks a writer waiting on a full socket before taking its lock.
     shutdown(mFd.get(), SHUT_RDWR);
+    std::lock_guard<std::mutex> g(mWriteLock);
+    mFd.reset();
     return links;
   }
 
   // Ends the connection from a pool thread; the I/O thread then sees the
   // hang-up and cleans up.
-  void abort() { shutdown(mFd.get(), SHUT_RDWR); }
+  void abort() {
+    std::lock_guard<std::mutex> g(mWriteLock);
+    if (mFd.get() >= 0) shutdown(mFd.get(), SHUT_RDWR);
+  }
 
   hardware::Status call(uint32_t object, uint32_t method, const BodyWriter& args,
                         std::vector<uint8_t>* reply) override {
@@ -350,12 +367,12 @@ class ServerConn : public RemotePeer, public std::enable_shared_from_this<Server
 
   bool send(const Frame& f) {
     std::lock_guard<std::mutex> g(mWriteLock);
-    return sendFrame(mFd.get(), f, kWriteStallMs);
+    return mFd.get() >= 0 && sendFrame(mFd.get(), f, kWriteStallMs);
   }
 
-  UniqueFd mFd;  // closed when the last user of the connection lets go
+  UniqueFd mFd;  // closed by the I/O thread only, under mWriteLock
   const std::string mName;
-  const sp<IBase> mService;
+  sp<IBase> mService;  // null once closed
   const StubFn mStub;
   const uid_t mUid;
   const pid_t mPid;

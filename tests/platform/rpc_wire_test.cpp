@@ -113,7 +113,7 @@ TEST(FrameDecoder, StaysBrokenAfterGarbage) {
   EXPECT_FALSE(d.next(&f));
 }
 
-TEST(Body, ReadsAreBoundedByWhatRemains) {
+TEST(RpcBody, ReadsAreBoundedByWhatRemains) {
   BodyWriter w;
   w.u8(7);
   w.u32(0xDEADBEEF);
@@ -159,7 +159,7 @@ TEST(Body, ReadsAreBoundedByWhatRemains) {
   EXPECT_FALSE(lt.text(&s, 2));
 }
 
-TEST(Body, WriterRefusesMoreThanAFrame) {
+TEST(RpcBody, WriterRefusesMoreThanAFrame) {
   BodyWriter w;
   std::vector<uint8_t> big(kMaxBodySize - 4);
   w.bytes(big.data(), big.size());
