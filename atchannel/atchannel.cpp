@@ -81,7 +81,7 @@ bool keyReady() { return pthread_once(&ac_key_once, make_key) == 0 && g_keyMade;
 AtContext* getAtContext() {
   AtContext* ac = nullptr;
   if (keyReady()) ac = static_cast<AtContext*>(pthread_getspecific(ac_key));
-  if (ac == nullptr) AT_LOGE("%s, m%d ac is NULL", "getAtContext", g_ulModemId);
+  if (ac == nullptr) AT_LOGE("%s, m%d ac is NULL", "getAtContext", static_cast<int32_t>(g_ulModemId));
   return ac;
 }
 
@@ -181,7 +181,7 @@ void closePort(AtContext* ac, bool commandLockHeld) {
   }
   wakeReader(ac);
   if (failedFd >= 0) {
-    AT_LOGE("m%d_%d>failed to close fd %d!", g_ulModemId, ac->index, failedFd);
+    AT_LOGE("m%d_%d>failed to close fd %d!", static_cast<int32_t>(g_ulModemId), ac->index, failedFd);
   }
 }
 
@@ -374,7 +374,7 @@ int32_t get_ac_index(void) {
     AT_LOGE("%s:getAtContext return null pointer!", "get_ac_index");
     return -1;
   }
-  AT_LOGD("%s:ac->index=%d,%d,%d", "get_ac_index", ac->index, g_ulModemId, currentFd(ac));
+  AT_LOGD("%s:ac->index=%d,%d,%d", "get_ac_index", ac->index, static_cast<int32_t>(g_ulModemId), currentFd(ac));
   return ac->index;
 }
 
@@ -410,7 +410,7 @@ int32_t at_open(int32_t fd, AtUnsolHandler h, int32_t index) {
     at_response_free(ac->response);
     ac->response = nullptr;
   }
-  AT_LOGD("%s,ac->index=%d,g_ulModemId=%d", "at_open", index, g_ulModemId);
+  AT_LOGD("%s,ac->index=%d,g_ulModemId=%d", "at_open", index, static_cast<int32_t>(g_ulModemId));
   drainWake(ac);
   ac->eof_count = 0;
 
@@ -443,7 +443,7 @@ void at_close(void) {
   // The unsolicited handler runs with command_lock held; a close from there
   // must not take it again.
   closePort(ac, t_inLockedHandler && t_readerOf == ac);
-  AT_LOGI("m%d_%d>at close.", g_ulModemId, ac->index);
+  AT_LOGI("m%d_%d>at close.", static_cast<int32_t>(g_ulModemId), ac->index);
   // request_lock stays: a command issued after the close still takes it and
   // must find a valid mutex (it then ends with -3).
   MutexGuard attrs(&g_attrLock);
@@ -647,7 +647,7 @@ int32_t at_send_command_full(const char* command, int32_t type, const char* resp
     }
     if (probe < 0) {
       ac->on_timeout();
-      AT_LOGE("m%d_%d< timeout.", g_ulModemId, ac->index);
+      AT_LOGE("m%d_%d< timeout.", static_cast<int32_t>(g_ulModemId), ac->index);
     }
   }
   return err;

@@ -1,3 +1,3 @@
 #include "se_modem_id.h"
 
-int32_t g_ulModemId = 0;
+std::atomic<int32_t> g_ulModemId{0};
