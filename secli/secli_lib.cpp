@@ -107,6 +107,20 @@ const CommandInfo kCommands[] = {
     {"sleep", CommandKind::Sleep, "sleep MS", "Waits MS milliseconds (for scripts)."},
 };
 
+std::vector<std::string> wordsOf(const std::string& text) {
+  std::vector<std::string> words;
+  std::string cur;
+  for (char c : text + " ") {
+    if (c == ' ' || c == '\n') {
+      if (!cur.empty()) words.push_back(cur);
+      cur.clear();
+    } else {
+      cur += c;
+    }
+  }
+  return words;
+}
+
 const CommandInfo* findCommand(const std::string& name) {
   for (const auto& c : kCommands) {
     if (name == c.name) return &c;
@@ -371,6 +385,7 @@ std::string formatJson(const Result& r) {
       break;
     case CommandKind::Transmit:
       s += ",\"response\":\"" + hexCompact(r.data) + "\"";
+      if (r.exchanges > 1) s += ",\"exchanges\":" + std::to_string(r.exchanges);
       break;
     case CommandKind::Close:
       s += ",\"status\":\"" + statusName(r.status) + "\"";
@@ -477,8 +492,16 @@ Result Session::run(const Command& c) {
       break;
     }
     case CommandKind::Transmit: {
-      auto ret = mSe->transmit(c.bytes, [&](const hidl_vec<uint8_t>& resp) { r.data = resp; });
-      if (!ret.isOk()) r.error = errorText(ret);
+      if (!mChain) {
+        r.data = exchange(c.bytes, &r.error);
+        break;
+      }
+      // A transport error ends the chain: the answers that follow are empty.
+      r.data = transmitChained(
+          c.bytes, [&](const std::vector<uint8_t>& apdu) {
+            return r.error.empty() ? exchange(apdu, &r.error) : std::vector<uint8_t>();
+          },
+          &r.exchanges);
       break;
     }
     case CommandKind::Close: {
@@ -498,14 +521,83 @@ Result Session::run(const Command& c) {
   return r;
 }
 
+std::vector<uint8_t> Session::exchange(const std::vector<uint8_t>& apdu, std::string* error) {
+  if (mTrace) fprintf(mTrace, "secli: trace > %s\n", hexGrouped(apdu).c_str());
+  std::vector<uint8_t> out;
+  auto ret = mSe->transmit(apdu, [&](const hidl_vec<uint8_t>& resp) { out = resp; });
+  if (!ret.isOk()) {
+    *error = errorText(ret);
+    out.clear();
+  }
+  if (mTrace) {
+    fprintf(mTrace, "secli: trace < %s\n",
+            !ret.isOk() ? "(transport error)" : out.empty() ? "(empty)" : hexGrouped(out).c_str());
+    fflush(mTrace);
+  }
+  return out;
+}
+
+uint8_t channelOfCla(uint8_t cla) {
+  return (cla & 0x40) ? static_cast<uint8_t>(4 + (cla & 0x0F)) : static_cast<uint8_t>(cla & 0x03);
+}
+
+uint8_t getResponseCla(uint8_t cla) {
+  const uint8_t ch = channelOfCla(cla);
+  return ch < 4 ? ch : static_cast<uint8_t>(0x40 | (ch - 4));
+}
+
+std::vector<uint8_t> withLe(const std::vector<uint8_t>& apdu, uint8_t le) {
+  std::vector<uint8_t> out = apdu;
+  const size_t n = apdu.size();
+  if (n == 4) {
+    out.push_back(le);  // case 1: add Le
+  } else if (n == 5) {
+    out[4] = le;  // case 2: replace Le
+  } else if (n > 5 && apdu[4] != 0 && n == 5u + apdu[4]) {
+    out.push_back(le);  // case 3: add Le
+  } else if (n > 5 && apdu[4] != 0 && n == 6u + apdu[4]) {
+    out.back() = le;  // case 4: replace Le
+  } else {
+    out.clear();  // too short or extended lengths: leave it to the caller
+  }
+  return out;
+}
+
+std::vector<uint8_t> transmitChained(const std::vector<uint8_t>& apdu, const TransmitFn& send,
+                                     int* exchanges) {
+  // Enough for the longest answer a card can give through 256-byte parts,
+  // and a stop for a card that never ends.
+  constexpr int kMaxExchanges = 300;
+  int sent = 0;
+  auto step = [&](const std::vector<uint8_t>& cmd) {
+    ++sent;
+    return send(cmd);
+  };
+  std::vector<uint8_t> resp = step(apdu);
+  if (resp.size() >= 2 && resp[resp.size() - 2] == 0x6C) {
+    std::vector<uint8_t> again = withLe(apdu, resp.back());
+    if (!again.empty()) resp = step(again);
+  }
+  std::vector<uint8_t> joined;
+  while (resp.size() >= 2 && resp[resp.size() - 2] == 0x61 && sent < kMaxExchanges) {
+    joined.insert(joined.end(), resp.begin(), resp.end() - 2);
+    const uint8_t cla = apdu.empty() ? 0 : getResponseCla(apdu[0]);
+    resp = step({cla, 0xC0, 0x00, 0x00, resp.back()});
+  }
+  if (exchanges) *exchanges = sent;
+  if (resp.size() < 2) return {};
+  joined.insert(joined.end(), resp.begin(), resp.end());
+  return joined;
+}
+
 std::string mainHelp() {
   std::string s =
       "secli: talk to the secure element service.\n"
       "\n"
       "Usage:\n"
       "  secli [--root DIR] [--json] list [--wait SECONDS]\n"
-      "  secli [--root DIR] [--json] [--timeout SECONDS] -i NAME COMMAND [ARG...]\n"
-      "  secli [--root DIR] [--json] [--timeout SECONDS] -i NAME -f FILE|-\n"
+      "  secli [--root DIR] [OPTIONS] -i NAME COMMAND [ARG...]\n"
+      "  secli [--root DIR] [OPTIONS] -i NAME -f FILE|-\n"
       "\n"
       "Options:\n"
       "  --root DIR         device root (default: $SE_DEVICE_ROOT, else /)\n"
@@ -515,16 +607,37 @@ std::string mainHelp() {
       "  -i NAME            the instance, e.g. SIM1 or eSE1 (see 'list')\n"
       "  -f FILE            run the commands of FILE (- for standard input), one a\n"
       "                     line, '#' starts a comment; all on one connection\n"
+      "  --chain            transmit follows 61xx with GET RESPONSE on the same\n"
+      "                     channel and resends on 6Cxx with the Le asked for,\n"
+      "                     printing the joined answer\n"
+      "  --trace            writes every APDU sent (>) and received (<) to\n"
+      "                     standard error, marked 'secli: trace'\n"
       "  -h, --help         this text; 'secli COMMAND --help' for one command\n"
       "\n"
       "Commands:\n";
+  // The first sentence of each command's help; its continuation lines
+  // indented under the first.
+  const std::string indent(21, ' ');
   for (const auto& c : kCommands) {
-    char line[128];
-    snprintf(line, sizeof(line), "  %-18s %s\n", c.usage,
-             std::string(c.help).substr(0, std::string(c.help).find('.') + 1).c_str());
-    s += line;
+    char head[32];
+    snprintf(head, sizeof(head), "  %-18s ", c.usage);
+    const std::string help(c.help);
+    std::string line = head;
+    size_t width = line.size();
+    for (const std::string& word : wordsOf(help.substr(0, help.find('.') + 1))) {
+      if (width > indent.size() && width + 1 + word.size() > 79) {
+        line += "\n" + indent;
+        width = indent.size();
+      } else if (width > indent.size()) {
+        line += ' ';
+        ++width;
+      }
+      line += word;
+      width += word.size();
+    }
+    s += line + "\n";
   }
-  s += "  list [--wait SECONDS] Lists the registered instances.\n"
+  s += "  list [--wait SECONDS]\n" + indent + "Lists the registered instances.\n"
        "\n"
        "Hex accepts upper or lower case and spaces; P2 and CHANNEL accept decimal or\n"
        "0x hex. Exit status: 0 when every call went through (whatever the status it\n"
@@ -534,7 +647,8 @@ std::string mainHelp() {
        "Example:\n"
        "  secli -i SIM1 init\n"
        "  secli -i SIM1 open A0000001510000 0x00\n"
-       "  secli -i SIM1 transmit 81 CA 9F 7F 00\n";
+       "  secli -i SIM1 transmit 81 CA 9F 7F 00\n"
+       "  secli -i eSE1 --chain --trace -f session.txt\n";
   return s;
 }
 
@@ -569,6 +683,10 @@ ArgsOutcome parseArgs(const std::vector<std::string>& args, Options* out, std::s
       return ArgsOutcome::Help;
     } else if (a == "--json") {
       o.json = true;
+    } else if (a == "--chain") {
+      o.chain = true;
+    } else if (a == "--trace") {
+      o.trace = true;
     } else if (a == "--root" || a.rfind("--root=", 0) == 0) {
       if (a == "--root") {
         if (!value(a, &v)) return ArgsOutcome::Usage;
@@ -728,6 +846,8 @@ int runMain(const std::vector<std::string>& args, FILE* out, FILE* err, FILE* in
   }
   ::android::host::setCallTimeout(se, o.timeoutMs);
   Session session(se, o.timeoutMs);
+  session.setChain(o.chain);
+  if (o.trace) session.setTrace(err);
   auto runOne = [&](const Command& c) {
     Result r = session.run(c);
     std::string text = o.json ? formatJson(r) : formatHuman(r);

@@ -2,6 +2,8 @@
 // secli's parsing, execution and output, apart from main() so tests can drive
 // them without processes.
 #include <cstdint>
+#include <cstdio>
+#include <functional>
 #include <optional>
 #include <string>
 #include <vector>
@@ -52,7 +54,27 @@ struct Result {
   uint8_t channel = 0;             // open
   uint32_t ms = 0;                 // sleep
   double waitedSeconds = 0;        // init: the time-out that ran out
+  int exchanges = 1;               // transmit: APDUs sent (more with --chain)
 };
+
+// The channel a command's CLA names: 0-3 in a first interindustry class,
+// 4-19 in a further one.
+uint8_t channelOfCla(uint8_t cla);
+// The CLA of a GET RESPONSE for a command sent with `cla`: same channel.
+uint8_t getResponseCla(uint8_t cla);
+// The command sent again with Le set to `le`, as a card's 6C xx asks; empty
+// when the command is not a short APDU whose Le can be set.
+std::vector<uint8_t> withLe(const std::vector<uint8_t>& apdu, uint8_t le);
+
+// One exchange on the wire; an empty answer means it failed.
+using TransmitFn = std::function<std::vector<uint8_t>(const std::vector<uint8_t>&)>;
+// Sends `apdu` and, like a phone framework for its clients, answers 6C xx by
+// sending it once more with Le xx, and follows 61 xx with GET RESPONSE on the
+// same channel until the card stops asking. Returns all data parts joined
+// with the last status word; empty when any exchange came back empty or
+// without a status word. *exchanges counts what was sent.
+std::vector<uint8_t> transmitChained(const std::vector<uint8_t>& apdu, const TransmitFn& send,
+                                     int* exchanges = nullptr);
 
 // One JSON object, no newline.
 std::string formatJson(const Result& r);
@@ -65,10 +87,18 @@ class Session {
  public:
   Session(::android::sp<ISecureElement> se, int timeoutMs);
   Result run(const Command& c);
+  // transmit follows 61xx and 6Cxx itself.
+  void setChain(bool on) { mChain = on; }
+  // Every APDU sent and received is written to `trace` ("> " and "< " lines).
+  void setTrace(FILE* trace) { mTrace = trace; }
 
  private:
+  std::vector<uint8_t> exchange(const std::vector<uint8_t>& apdu, std::string* error);
+
   ::android::sp<ISecureElement> mSe;
   int mTimeoutMs;
+  bool mChain = false;
+  FILE* mTrace = nullptr;
 };
 
 // Command line.
@@ -76,6 +106,8 @@ struct Options {
   std::string root;          // --root; empty: $SE_DEVICE_ROOT
   bool json = false;         // --json
   int timeoutMs = 10000;     // --timeout SECONDS
+  bool chain = false;        // --chain
+  bool trace = false;        // --trace
   std::string instance;      // -i NAME
   std::string script;        // -f FILE ("-": standard input)
   bool list = false;         // the list command

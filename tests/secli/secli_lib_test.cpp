@@ -186,6 +186,11 @@ TEST(SecliParse, ArgumentsAndHelpOnEveryLevel) {
   EXPECT_EQ(o.timeoutMs, 2500);
   EXPECT_EQ(o.instance, "eSE1");
   EXPECT_EQ(o.script, "s.txt");
+  EXPECT_FALSE(o.chain);
+  ASSERT_EQ(parseArgs({"--chain", "--trace", "-i", "eSE1", "present"}, &o, &message),
+            ArgsOutcome::Run);
+  EXPECT_TRUE(o.chain);
+  EXPECT_TRUE(o.trace);
   ASSERT_EQ(parseArgs({"list", "--wait", "3"}, &o, &message), ArgsOutcome::Run);
   EXPECT_TRUE(o.list);
   EXPECT_EQ(o.listWaitMs, 3000);
@@ -306,6 +311,118 @@ TEST(SecliOutput, StatusWordCatalogue) {
   EXPECT_EQ(statusWordNote({0x90}), "");
   EXPECT_EQ(hexGrouped({0x00, 0xAB, 0x0F}), "00 AB 0F");
   EXPECT_EQ(hexCompact({0x00, 0xab, 0x0f}), "00AB0F");
+}
+
+// Every help line fits a terminal and each command starts its own line.
+TEST(SecliHelp, LinesFitAndEveryCommandHasItsOwnLine) {
+  const std::string help = mainHelp();
+  size_t start = 0;
+  for (size_t nl = help.find('\n'); nl != std::string::npos; nl = help.find('\n', start)) {
+    EXPECT_LE(nl - start, 79u) << help.substr(start, nl - start);
+    start = nl + 1;
+  }
+  for (const char* usage : {"init", "present", "atr", "open AID [P2]", "basic AID [P2]",
+                            "transmit APDU", "close CHANNEL", "sleep MS", "list [--wait SECONDS]"}) {
+    EXPECT_NE(help.find(std::string("\n  ") + usage + (usage[0] == 'l' ? "\n" : " ")),
+              std::string::npos)
+        << usage;
+  }
+}
+
+using Bytes = std::vector<uint8_t>;
+
+TEST(SecliChain, ChannelInClaOfGetResponseAndLeRewrite) {
+  const std::pair<uint8_t, uint8_t> clas[] = {
+      {0x00, 0x00}, {0x03, 0x03}, {0x81, 0x01}, {0x0C, 0x00}, {0x40, 0x40}, {0x4F, 0x4F}, {0xCA, 0x4A}};
+  for (const auto& c : clas) EXPECT_EQ(getResponseCla(c.first), c.second) << int(c.first);
+  EXPECT_EQ(channelOfCla(0x41), 5);
+  EXPECT_EQ(channelOfCla(0x4F), 19);
+
+  const std::pair<Bytes, Bytes> les[] = {
+      {{0x00, 0xCA, 0x00, 0x66}, {0x00, 0xCA, 0x00, 0x66, 0x10}},              // case 1
+      {{0x00, 0xCA, 0x00, 0x66, 0x00}, {0x00, 0xCA, 0x00, 0x66, 0x10}},        // case 2
+      {{0x01, 0x01, 0x00, 0x00, 0x01, 0xAA}, {0x01, 0x01, 0x00, 0x00, 0x01, 0xAA, 0x10}},  // 3
+      {{0x01, 0x01, 0x00, 0x00, 0x01, 0xAA, 0x05}, {0x01, 0x01, 0x00, 0x00, 0x01, 0xAA, 0x10}},
+      {{0x00, 0xCA, 0x00}, {}},                                               // too short
+      {{0x00, 0xCA, 0x00, 0x00, 0x00, 0x01, 0x00}, {}},                         // extended
+      {{0x01, 0x01, 0x00, 0x00, 0x03, 0xAA}, {}},                               // Lc too long
+  };
+  for (const auto& c : les) EXPECT_EQ(withLe(c.first, 0x10), c.second) << c.first.size();
+}
+
+// A scripted card: each command sent is recorded and answered from a list.
+struct FakeLink {
+  std::vector<Bytes> answers;
+  std::vector<Bytes> sent;
+  TransmitFn fn() {
+    return [this](const Bytes& apdu) {
+      sent.push_back(apdu);
+      if (sent.size() > answers.size()) return Bytes{0x6F, 0x00};
+      return answers[sent.size() - 1];
+    };
+  }
+};
+
+TEST(SecliChain, FollowsTheCardLikeAFramework) {
+  struct Case {
+    const char* what;
+    Bytes apdu;
+    std::vector<Bytes> answers;
+    std::vector<Bytes> wantSent;
+    Bytes want;
+  };
+  const Case cases[] = {
+      {"plain answer", {0x01, 0x01, 0x00, 0x00, 0x01, 0xAA}, {{0xAA, 0x90, 0x00}},
+       {{0x01, 0x01, 0x00, 0x00, 0x01, 0xAA}}, {0xAA, 0x90, 0x00}},
+      {"two GET RESPONSE parts on channel 2",
+       {0x02, 0x11, 0x00, 0x04, 0x00},
+       {{0x61, 0x02}, {0x00, 0x01, 0x61, 0x02}, {0x02, 0x03, 0x90, 0x00}},
+       {{0x02, 0x11, 0x00, 0x04, 0x00}, {0x02, 0xC0, 0x00, 0x00, 0x02}, {0x02, 0xC0, 0x00, 0x00, 0x02}},
+       {0x00, 0x01, 0x02, 0x03, 0x90, 0x00}},
+      {"GET RESPONSE on channel 6 in a further class",
+       {0x42, 0xCA, 0x00, 0x66, 0x00},
+       {{0x61, 0x01}, {0x7F, 0x90, 0x00}},
+       {{0x42, 0xCA, 0x00, 0x66, 0x00}, {0x42, 0xC0, 0x00, 0x00, 0x01}},
+       {0x7F, 0x90, 0x00}},
+      {"6C then the exact Le, then more data",
+       {0x01, 0x01, 0x00, 0x00, 0x02, 0xAB, 0xCD, 0x05},
+       {{0x6C, 0x02}, {0x61, 0x02}, {0xAB, 0xCD, 0x90, 0x00}},
+       {{0x01, 0x01, 0x00, 0x00, 0x02, 0xAB, 0xCD, 0x05},
+        {0x01, 0x01, 0x00, 0x00, 0x02, 0xAB, 0xCD, 0x02},
+        {0x01, 0xC0, 0x00, 0x00, 0x02}},
+       {0xAB, 0xCD, 0x90, 0x00}},
+      {"a second 6C is the answer", {0x00, 0xCA, 0x00, 0x66, 0x00}, {{0x6C, 0x03}, {0x6C, 0x04}},
+       {{0x00, 0xCA, 0x00, 0x66, 0x00}, {0x00, 0xCA, 0x00, 0x66, 0x03}}, {0x6C, 0x04}},
+      {"error status ends the chain with the parts so far",
+       {0x00, 0xB0, 0x00, 0x00, 0x00},
+       {{0x61, 0x01}, {0x6A, 0x82}},
+       {{0x00, 0xB0, 0x00, 0x00, 0x00}, {0x00, 0xC0, 0x00, 0x00, 0x01}},
+       {0x6A, 0x82}},
+      {"an empty answer fails the whole exchange",
+       {0x00, 0xB0, 0x00, 0x00, 0x00},
+       {{0x10, 0x61, 0x01}, {}},
+       {{0x00, 0xB0, 0x00, 0x00, 0x00}, {0x00, 0xC0, 0x00, 0x00, 0x01}},
+       {}},
+  };
+  for (const Case& c : cases) {
+    FakeLink link;
+    link.answers = c.answers;
+    int exchanges = 0;
+    EXPECT_EQ(transmitChained(c.apdu, link.fn(), &exchanges), c.want) << c.what;
+    EXPECT_EQ(link.sent, c.wantSent) << c.what;
+    EXPECT_EQ(exchanges, static_cast<int>(c.wantSent.size())) << c.what;
+  }
+}
+
+TEST(SecliChain, ACardThatNeverStopsIsLeftAfterABound) {
+  int calls = 0;
+  const Bytes got = transmitChained({0x00, 0xB0, 0x00, 0x00, 0x00}, [&](const Bytes&) {
+    ++calls;
+    return Bytes{0x55, 0x61, 0x01};
+  });
+  EXPECT_EQ(calls, 300);
+  ASSERT_GE(got.size(), 2u);
+  EXPECT_EQ(got[got.size() - 2], 0x61);
 }
 
 }  // namespace
