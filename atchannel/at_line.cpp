@@ -3,7 +3,8 @@
 #include <android/log.h>
 #include <securec.h>
 
-#include <cctype>
+#include <cstddef>
+#include <cstdint>
 #include <cstring>
 
 #include "atchannel.h"
@@ -62,17 +63,44 @@ int32_t dropNuls(char* p, int32_t n) {
   return out;
 }
 
-bool containsNoCase(const char* text, const char* word) {
-  size_t wl = strlen(word);
-  for (const char* t = text; *t != '\0'; ++t) {
-    size_t i = 0;
-    while (i < wl && t[i] != '\0' &&
-           tolower(static_cast<unsigned char>(t[i])) == tolower(static_cast<unsigned char>(word[i]))) {
-      ++i;
+// Case folding as tolower() does it in the C locale the daemon runs in.
+inline unsigned char foldAscii(unsigned char c) {
+  return (c >= 'A' && c <= 'Z') ? static_cast<unsigned char>(c - 'A' + 'a') : c;
+}
+
+// The mask words grouped by their folded first character, each group in
+// table order, so that one pass over a text finds the earliest word in the
+// table. Every sent and received AT line goes through the search, and an
+// APDU line is over 500 characters: trying the 70 words one by one over the
+// whole line cost more than the modem exchange itself.
+struct MaskIndex {
+  uint8_t first[256][AT_MASK_WORD_COUNT];
+  uint8_t count[256];
+  uint8_t length[AT_MASK_WORD_COUNT];
+};
+
+const MaskIndex& maskIndex() {
+  static const MaskIndex index = [] {
+    MaskIndex m{};
+    for (size_t w = 0; w < static_cast<size_t>(AT_MASK_WORD_COUNT); ++w) {
+      const unsigned char c = foldAscii(static_cast<unsigned char>(at_mask_words[w][0]));
+      m.first[c][m.count[c]++] = static_cast<uint8_t>(w);
+      m.length[w] = static_cast<uint8_t>(strlen(at_mask_words[w]));
     }
-    if (i == wl) return true;
+    return m;
+  }();
+  return index;
+}
+
+// Whether `word` (of length `wl`) starts at `t`, compared without regard to case.
+bool matchesAt(const char* t, const char* word, size_t wl) {
+  for (size_t i = 1; i < wl; ++i) {
+    if (t[i] == '\0' ||
+        foldAscii(static_cast<unsigned char>(t[i])) != foldAscii(static_cast<unsigned char>(word[i]))) {
+      return false;
+    }
   }
-  return false;
+  return true;
 }
 
 }  // namespace
@@ -152,8 +180,18 @@ int32_t at_is_sms_unsolicited(const char* line) { return startsWithAny(line, kSm
 
 const char* at_mask_find(const char* text) {
   if (text == nullptr) return nullptr;
-  for (const char* word : at_mask_words) {
-    if (containsNoCase(text, word)) return word;
+  const MaskIndex& m = maskIndex();
+  size_t best = static_cast<size_t>(AT_MASK_WORD_COUNT);  // earliest table index found so far
+  for (const char* t = text; *t != '\0' && best > 0; ++t) {
+    const unsigned char c = foldAscii(static_cast<unsigned char>(*t));
+    for (uint8_t k = 0; k < m.count[c]; ++k) {
+      const uint8_t w = m.first[c][k];
+      if (w >= best) break;  // groups are in table order
+      if (matchesAt(t, at_mask_words[w], m.length[w])) {
+        best = w;
+        break;
+      }
+    }
   }
-  return nullptr;
+  return best < static_cast<size_t>(AT_MASK_WORD_COUNT) ? at_mask_words[best] : nullptr;
 }

@@ -3,6 +3,8 @@
 #include <gtest/gtest.h>
 #include <host/log_capture.h>
 
+#include <cctype>
+#include <cstdint>
 #include <cstring>
 #include <string>
 #include <vector>
@@ -255,6 +257,38 @@ TEST(Masking, WordsAreFoundInTableOrderWithoutRegardToCase) {
     } else {
       ASSERT_NE(got, nullptr) << c.text;
       EXPECT_STREQ(got, c.word) << c.text;
+    }
+  }
+}
+
+// The search runs once over the text; it must still give the word that
+// comes first in the table, wherever in the text each word stands. Checked
+// against the plain word-by-word search on texts mixed from word pieces.
+TEST(Masking, SinglePassAgreesWithWordByWordSearch) {
+  auto plain = [](const std::string& text) -> const char* {
+    std::string low = text;
+    for (char& ch : low) ch = static_cast<char>(tolower(static_cast<unsigned char>(ch)));
+    for (const char* word : at_mask_words) {
+      std::string w = word;
+      for (char& ch : w) ch = static_cast<char>(tolower(static_cast<unsigned char>(ch)));
+      if (low.find(w) != std::string::npos) return word;
+    }
+    return nullptr;
+  };
+  const char* const pieces[] = {"+CGLA: 514,\"", "0A1B", "crs", "M", "CLC", "c", "ECONF", "CSIM", ":",
+                                "=", "\"", " ", "VOLTEIMP", "I:", "CPIN2", "DMC", "N", "\xC3\xA9"};
+  uint32_t seed = 12345;
+  for (int n = 0; n < 5000; ++n) {
+    std::string text;
+    for (int k = 0; k < 12; ++k) {
+      seed = seed * 1103515245u + 12345u;
+      text += pieces[(seed >> 16) % (sizeof(pieces) / sizeof(pieces[0]))];
+    }
+    const char* want = plain(text);
+    const char* got = at_mask_find(text.c_str());
+    ASSERT_EQ(got == nullptr, want == nullptr) << text;
+    if (want != nullptr) {
+      ASSERT_STREQ(got, want) << text;
     }
   }
 }
