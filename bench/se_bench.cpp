@@ -93,11 +93,12 @@ struct Options {
   size_t rounds = 5;
   int startups = 7;
   bool keep = false;
+  std::string daemonLog;  // empty: daemon.log in the device root
 };
 
 const char kUsage[] =
     "usage: se-bench [--bin DIR] [--lib DIR] [--ese N] [--sim N] [--rounds N]\n"
-    "                [--startups N] [--keep]\n"
+    "                [--startups N] [--daemon-log FILE] [--keep]\n"
     "  --bin DIR      folder of qvese@1.0-service, modem-sim, se-bench-select\n"
     "                 (default: this program's folder)\n"
     "  --lib DIR      folder of libese_qv_hal.so (default: DIR/../lib)\n"
@@ -105,6 +106,8 @@ const char kUsage[] =
     "  --sim N        timed exchanges per SIM case (default 2000)\n"
     "  --rounds N     interleaved rounds the exchanges are split into (default 5)\n"
     "  --startups N   daemon launches timed for start-up (default 7)\n"
+    "  --daemon-log F where the measured daemon's log goes (default: daemon.log\n"
+    "                 in its device root; /dev/null shows what logging costs)\n"
     "  --keep         keep the temporary device roots and their logs\n";
 
 std::string selfDir() {
@@ -142,6 +145,8 @@ Options parseOptions(int argc, char** argv) {
       o.rounds = static_cast<size_t>(count(1));
     } else if (a == "--startups") {
       o.startups = static_cast<int>(count(1));
+    } else if (a == "--daemon-log") {
+      o.daemonLog = value();
     } else if (a == "--keep") {
       o.keep = true;
     } else if (a == "--help" || a == "-h") {
@@ -309,10 +314,11 @@ bool accepts(const std::string& path) {
 
 // Starts the daemon in `root`; the time until both instances accept
 // connections in *startupNanos.
-Child startDaemon(const Options& o, const std::string& root, int64_t* startupNanos) {
+Child startDaemon(const Options& o, const std::string& root, int64_t* startupNanos,
+                  const std::string& log = "") {
   const std::string dir = root + "/dev/socket/secure_element/";
   int64_t t0 = nowNanos();
-  Child d({o.binDir + "/qvese@1.0-service"}, root, -1, root + "/daemon.log");
+  Child d({o.binDir + "/qvese@1.0-service"}, root, -1, log.empty() ? root + "/daemon.log" : log);
   bool ese = false, sim = false;
   while (!(ese && sim)) {
     if (nowNanos() - t0 > 10 * 1000000000LL) fail("the daemon did not register both instances in " + root);
@@ -555,6 +561,17 @@ std::string loadAverage() {
   return a + " " + b + " " + c;
 }
 
+// Lines of `path` that contain `needle`.
+size_t countLines(const std::string& path, const std::string& needle) {
+  std::ifstream in(path);
+  std::string line;
+  size_t n = 0;
+  while (std::getline(in, line)) {
+    if (line.find(needle) != std::string::npos) ++n;
+  }
+  return n;
+}
+
 std::map<std::string, std::string> procStatus(pid_t pid) {
   std::map<std::string, std::string> out;
   std::ifstream in("/proc/" + std::to_string(pid) + "/status");
@@ -620,7 +637,7 @@ int main(int argc, char** argv) {
   Child modem = startModemSim(o, root.path());
   Child floorModem = startModemSim(o, floorRoot.path());
   int64_t firstStart = 0;
-  Child daemon = startDaemon(o, root.path(), &firstStart);
+  Child daemon = startDaemon(o, root.path(), &firstStart, o.daemonLog);
   setenv("SE_DEVICE_ROOT", root.path().c_str(), 1);
 
   sp<ISecureElement> ese = connectInstance("eSE1");
@@ -658,6 +675,11 @@ int main(int argc, char** argv) {
     return r.isOk() && same;
   };
 
+  // Log lines of the SIM path: the radio buffer is the SIM side's alone.
+  const std::string daemonLog = o.daemonLog.empty() ? root.path() + "/daemon.log" : "";
+  const size_t radioBefore = daemonLog.empty() ? 0 : countLines(daemonLog, "[radio] ");
+  size_t simCalls = 0;
+
   Series rpcFloor;
   Series libFloor[2], modemFloor[2], eseTx[2], simTx[2];
   const size_t eseWarm = std::max<size_t>(o.eseCount / 20, 20);
@@ -672,6 +694,7 @@ int main(int argc, char** argv) {
       }
       if (i < simWarm) {
         (void)viaRpc(sim, simCases[k]);
+        ++simCalls;
         (void)port.command(modemCommands[k], &lines);
       }
     }
@@ -694,23 +717,35 @@ int main(int argc, char** argv) {
       });
       timeInto(simTx[k], simRound, std::string("SIM1 ") + simCases[k].name,
                [&] { return viaRpc(sim, simCases[k]); });
+      simCalls += simRound;
     }
   }
+  const double radioLinesPerCall =
+      daemonLog.empty() ? -1 : static_cast<double>(countLines(daemonLog, "[radio] ") - radioBefore) / simCalls;
 
-  // Modem choice, in a helper that resolves its paths under the same root.
-  Stats select;
+  // Modem choice and one log line, in a helper that resolves its paths
+  // under the same root.
+  Stats select, logLine;
+  double choiceLinesPerCall = 0;
   {
     int p[2];
     if (pipe(p) != 0) fail("pipe");
-    Child helper({o.binDir + "/se-bench-select", std::to_string(o.simCount)}, root.path(), p[1],
-                 root.path() + "/bench-select.log");
+    const std::string helperLog = root.path() + "/bench-select.log";
+    Child helper({o.binDir + "/se-bench-select", std::to_string(o.simCount)}, root.path(), p[1], helperLog);
     close(p[1]);
-    std::string line = readLine(p[0], 60000);
+    std::string first = readLine(p[0], 60000);
+    std::string second = readLine(p[0], 60000);
     close(p[0]);
-    if (helper.wait() != 0 || sscanf(line.c_str(), "select %zu %lf %lf %lf", &select.count, &select.medianUs,
-                                     &select.p99Us, &select.perSecond) != 4) {
-      fail("modem choice helper failed: " + line);
+    size_t selectCalls = 0, logCalls = 0;
+    if (helper.wait() != 0 ||
+        sscanf(first.c_str(), "select %zu %lf %lf %lf %zu", &select.count, &select.medianUs, &select.p99Us,
+               &select.perSecond, &selectCalls) != 5 ||
+        sscanf(second.c_str(), "log %zu %lf %lf %lf %zu", &logLine.count, &logLine.medianUs, &logLine.p99Us,
+               &logLine.perSecond, &logCalls) != 5 ||
+        selectCalls == 0) {
+      fail("modem choice helper failed: " + first);
     }
+    choiceLinesPerCall = static_cast<double>(countLines(helperLog, " QvAtChannel: ")) / selectCalls;
   }
 
   auto status = procStatus(daemon.pid());
@@ -724,7 +759,8 @@ int main(int argc, char** argv) {
   uname(&un);
   printf("se-bench, %s; %ld CPUs, %s; %s %s\n", date, sysconf(_SC_NPROCESSORS_ONLN), cpuModel().c_str(),
          un.sysname, un.release);
-  printf("load average before %s, after %s\n\n", loadBefore.c_str(), loadAfter.c_str());
+  printf("load average before %s, after %s; daemon log to %s\n\n", loadBefore.c_str(), loadAfter.c_str(),
+         o.daemonLog.empty() ? "a file" : o.daemonLog.c_str());
   printf("| %-52s | %6s | %9s | %9s | %8s |\n", "measurement", "n", "median us", "p99 us", "per s");
   printf("|%s|%s|%s|%s|%s|\n", std::string(54, '-').c_str(), std::string(8, '-').c_str(),
          std::string(11, '-').c_str(), std::string(11, '-').c_str(), std::string(10, '-').c_str());
@@ -734,6 +770,7 @@ int main(int argc, char** argv) {
   for (int k = 0; k < 2; ++k) row(std::string("eSE1 transmit ") + eseCases[k].name, eseTx[k].stats());
   for (int k = 0; k < 2; ++k) row(std::string("SIM1 transmit ") + simCases[k].name, simTx[k].stats());
   row("SIM modem choice (communication_which_modem)", select);
+  row("one log line into a file", logLine);
 
   const double rpc = rpcFloor.stats().medianUs;
   printf("\n| %-52s | %14s | %14s |\n", "ratio of medians", "case-2", "case-4");
@@ -745,6 +782,22 @@ int main(int argc, char** argv) {
   }
   printf("| %-52s | %14.2f | %14.2f |\n", "eSE1 transmit / (RPC floor + library floor)", eseRatio[0], eseRatio[1]);
   printf("| %-52s | %14.2f | %14.2f |\n", "SIM1 transmit / (RPC floor + modem floor)", simRatio[0], simRatio[1]);
+
+
+  // Where a SIM1 exchange spends what the floors do not explain.
+  if (radioLinesPerCall >= 0) {
+    printf("\nSIM1 transmit, what the floors leave (medians, us):\n");
+    const double lines = radioLinesPerCall - choiceLinesPerCall;
+    for (int k = 0; k < 2; ++k) {
+      const double total = simTx[k].stats().medianUs;
+      const double floors = rpc + modemFloor[k].stats().medianUs;
+      const double logs = lines * logLine.medianUs;
+      printf("  %-15s %7.1f = floors %.1f + modem choice %.1f (%.0f log lines in it) + %.0f other log lines ~%.1f"
+             " + rest %.1f (hand-offs to the worker and reader threads and back, AT text)\n",
+             simCases[k].name, total, floors, select.medianUs, choiceLinesPerCall, lines, logs,
+             total - floors - select.medianUs - logs);
+    }
+  }
 
   printf("\nstart-up to both instances registered: median %.1f ms, max %.1f ms over %d launches\n",
          startup.medianUs / 1000.0, startupMax / 1e6, o.startups);

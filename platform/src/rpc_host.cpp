@@ -474,9 +474,12 @@ class Host {
   }
 
   void queue(std::function<void()> task) {
-    std::lock_guard<std::mutex> g(mLock);
-    if (mStopping) return;
-    mTasks.push_back(std::move(task));
+    {
+      std::lock_guard<std::mutex> g(mLock);
+      if (mStopping) return;
+      mTasks.push_back(std::move(task));
+    }
+    // Woken after the unlock, the pool thread finds the lock free.
     mTaskCv.notify_one();
   }
 
@@ -560,7 +563,9 @@ class Host {
       task = nullptr;
       lk.lock();
       --mBusy;
-      mTaskCv.notify_one();
+      // Only a task held back by the limit needs another thread now; waking
+      // an idle one for nothing costs a context switch per call.
+      if (!mTasks.empty()) mTaskCv.notify_one();
     }
   }
 
