@@ -1,7 +1,12 @@
 #!/usr/bin/env bash
 # Installs the Debian packages the build needs, when any is missing.
+#   scripts/deps.sh        compilers, CMake and GoogleTest
+#   scripts/deps.sh fuzz   also clang and its runtimes (libFuzzer, sanitizers)
 set -euo pipefail
 pkgs=(cmake make g++ libgtest-dev libgmock-dev)
+if [ "${1:-}" = fuzz ]; then
+  pkgs+=(clang libclang-rt-14-dev)
+fi
 missing=()
 for p in "${pkgs[@]}"; do
   dpkg-query -W -f='${Status}' "$p" 2>/dev/null | grep -q "install ok installed" || missing+=("$p")
