@@ -1,10 +1,272 @@
 #!/usr/bin/env bash
-# Builds when needed and shows the client's help.
-set -euo pipefail
+# The whole daemon on this machine: a temporary device root, the simulated
+# modem(s) and eSE library, the daemon, and a secli session on each instance,
+# printed as a transcript. Exits non-zero when any step did not give what it
+# should.
+set -uo pipefail
 cd "$(dirname "$0")/.."
-scripts/deps.sh
-if [ ! -x build/bin/secli ]; then
-  cmake -S . -B build >/dev/null
-  cmake --build build -j"$(nproc)" >/dev/null
+
+usage() {
+  cat <<'EOF'
+usage: scripts/demo.sh [--two-modems] [--keep] [--help]
+
+Builds the programs when needed, then in a fresh temporary device root:
+writes the properties and the NFC sysfs nodes, starts modem-sim, starts the
+daemon with the simulated eSE library, and runs a secli session on "eSE1" and
+on "SIM1" (init, presence, ATR, logical channels, APDUs, an answer in several
+parts fetched with GET RESPONSE, close, the basic channel), checking every
+answer. Every process it starts is stopped at the end.
+
+  --two-modems  run a second modem-sim (modem 1, another ATR) and show "SIM1"
+                following the NFC SIM switch node to it
+  --keep        keep the device root (logs, properties) and print its path
+  --help        this text
+
+Environment: BUILD_DIR (default build) is where the programs are built.
+EOF
+}
+
+two_modems=0
+keep=0
+for a in "$@"; do
+  case "$a" in
+    --two-modems) two_modems=1 ;;
+    --keep) keep=1 ;;
+    -h | --help) usage; exit 0 ;;
+    *) echo "demo: unknown option '$a'" >&2; usage >&2; exit 2 ;;
+  esac
+done
+
+build=${BUILD_DIR:-build}
+bin=$build/bin
+targets=(qvese_service secli modem-sim ese_qv_hal)
+
+# ---- build, quietly ---------------------------------------------------------
+if [ ! -f "$build/CMakeCache.txt" ]; then
+  echo "demo: first run: building the daemon and the tools into $build (a few minutes)"
+  scripts/deps.sh || exit 1
+  if ! cmake -S . -B "$build" >"/tmp/se-demo-build.$$.log" 2>&1; then
+    cat "/tmp/se-demo-build.$$.log" >&2; exit 1
+  fi
 fi
-build/bin/secli --help
+if ! cmake --build "$build" -j"$(nproc)" --target "${targets[@]}" >"/tmp/se-demo-build.$$.log" 2>&1; then
+  cat "/tmp/se-demo-build.$$.log" >&2
+  echo "demo: build failed" >&2
+  exit 1
+fi
+rm -f "/tmp/se-demo-build.$$.log"
+
+# ---- processes and clean-up ---------------------------------------------------
+root=$(mktemp -d /tmp/se-demo.XXXXXX)
+pids=()
+cleanup() {
+  local p
+  for p in "${pids[@]}"; do kill -TERM "$p" 2>/dev/null; done
+  for p in "${pids[@]}"; do wait "$p" 2>/dev/null; done
+  if [ "$keep" = 1 ]; then
+    echo "demo: device root kept: $root"
+  else
+    rm -rf "$root"
+  fi
+}
+trap cleanup EXIT
+trap 'exit 130' INT TERM
+
+# Waits up to 10 s until FILE holds TEXT.
+wait_for() {
+  local file=$1 text=$2 i
+  for ((i = 0; i < 200; i++)); do
+    grep -qF -- "$text" "$file" 2>/dev/null && return 0
+    sleep 0.05
+  done
+  echo "demo: gave up waiting for '$text' in $file" >&2
+  return 1
+}
+
+# ---- transcript helpers ---------------------------------------------------------
+steps=0
+failed=0
+out_fd=
+err_file=
+trace_seen=0
+daemon_seen=0
+modem_seen=0
+answer=
+
+group() { sed 's/\([0-9A-F][0-9A-F]\)/\1 /g; s/ $//' <<<"$1"; }
+cla_of() { # the CLA naming logical channel $1
+  if [ "$1" -lt 4 ]; then printf '%02X' "$1"; else printf '%02X' $((0x40 | ($1 - 4))); fi
+}
+
+# Starts secli on instance $1, reading commands from us one at a time.
+session_start() {
+  err_file=$root/secli-$1.err
+  : >"$err_file"
+  trace_seen=0
+  coproc SECLI { exec "$bin/secli" --root "$root" --chain --trace --timeout 20 -i "$1" -f - 2>"$err_file"; }
+  pids+=("$SECLI_PID")
+  out_fd=${SECLI[0]}
+}
+session_end() {
+  exec {SECLI[1]}>&-
+  wait "$SECLI_PID" 2>/dev/null
+}
+
+# step WHAT EXPECT_REGEX COMMAND [DAEMON_LOG_REGEX [MODEM_LOG_REGEX]]
+# Sends one command, prints it, the answer (hex grouped), the trace of a
+# chained exchange and, when given, the first matching line the command
+# brought to the daemon's log (AT command contents are masked there) and to
+# the modem's.
+step() {
+  local what=$1 expect=$2 cmd=$3 logre=${4:-} modemre=${5:-}
+  steps=$((steps + 1))
+  printf '\n  # %s\n  > %s\n' "$what" "$cmd"
+  echo "$cmd" >&"${SECLI[1]}"
+  answer=
+  if ! IFS= read -r -t 30 answer <&"$out_fd"; then
+    answer="(no answer: $(tail -n 3 "$err_file"))"
+  fi
+  # Select responses in groups too.
+  local shown=$answer
+  if [[ $shown =~ ^(.*select=)([0-9A-F]+)(.*)$ ]]; then
+    shown="${BASH_REMATCH[1]}$(group "${BASH_REMATCH[2]}")${BASH_REMATCH[3]}"
+  fi
+  # What went over the wire when secli had to fetch the rest itself.
+  local trace
+  trace=$(tail -n +$((trace_seen + 1)) "$err_file" | grep '^secli: trace')
+  trace_seen=$(wc -l <"$err_file")
+  if [ "$(grep -c . <<<"$trace")" -gt 2 ]; then
+    sed 's/^secli: trace /      wire /' <<<"$trace"
+  fi
+  printf '  < %s\n' "$shown"
+  local line
+  if [ -n "$logre" ]; then
+    line=$(tail -c +$((daemon_seen + 1)) "$root/daemon.log" | grep -m1 -E -- "$logre" |
+      sed -E 's/^(\[[a-z]+\]) [0-9-]+ [0-9:.]+ +[0-9]+ +[0-9]+ /\1 /')
+    [ -n "$line" ] && printf '    daemon log: %s\n' "$line"
+  fi
+  daemon_seen=$(wc -c <"$root/daemon.log")
+  if [ -n "$modemre" ]; then
+    line=$(tail -c +$((modem_seen + 1)) "$root/modem0.log" | grep -m1 -E -- "$modemre")
+    [ -n "$line" ] && printf '    modem0.log: %s\n' "$line"
+  fi
+  modem_seen=$(wc -c <"$root/modem0.log")
+  if [[ $answer =~ $expect ]]; then
+    printf '    as expected\n'
+  else
+    printf '    NOT AS EXPECTED (wanted /%s/)\n' "$expect"
+    failed=$((failed + 1))
+  fi
+}
+
+# The channel number out of the last open's answer.
+channel() { [[ $answer =~ channel=([0-9]+) ]] && echo "${BASH_REMATCH[1]}" || echo 0; }
+
+# ---- the device root --------------------------------------------------------------
+# The applets of the virtual card (card/card_applets.h).
+ECHO=A00000000101   # INS 01: data back; wrong Le answered with 6C xx
+BIG=A00000000102    # answers left for GET RESPONSE (61 xx)
+NONE=A00000000199   # not on the card
+
+mkdir -p "$root/sys/nfc"
+{
+  echo "vendor.ese_sim.type=1"                       # an eSE is fitted
+  echo "ro.odm.config.modem_number=$((two_modems + 1))"
+} >"$root/properties"
+# NFC routed to SIM 1, one card, eSE type 0.
+echo 1 >"$root/sys/nfc/nfc_sim_switch"
+echo 1 >"$root/sys/nfc/nfc_card_num"
+echo 0 >"$root/sys/nfc/nfc_wired_ese_type"
+
+echo "Secure element service demo"
+echo "device root: $root"
+echo
+"$bin/modem-sim" --root "$root" --modem 0 --log "$root/modem0.log" >"$root/modem0.out" 2>&1 &
+pids+=($!)
+wait_for "$root/modem0.out" "ready" || exit 1
+echo "modem-sim:   modem 0 on $root/dev/appvcom18 (log: modem0.log)"
+if [ "$two_modems" = 1 ]; then
+  "$bin/modem-sim" --root "$root" --modem 1 --atr 3B8880014D4F44454D31AA --log "$root/modem1.log" \
+    >"$root/modem1.out" 2>&1 &
+  pids+=($!)
+  wait_for "$root/modem1.out" "ready" || exit 1
+  echo "modem-sim:   modem 1 on $root/dev/appvcom34 (log: modem1.log)"
+fi
+SE_DEVICE_ROOT=$root "$bin/qvese@1.0-service" 2>"$root/daemon.log" &
+pids+=($!)
+wait_for "$root/daemon.log" "Registered sim1 success" || exit 1
+echo "daemon:      qvese@1.0-service, instances: $("$bin/secli" --root "$root" list | tr '\n' ' ')(log: daemon.log)"
+
+# ---- eSE1 ---------------------------------------------------------------------------
+echo
+echo "== eSE1: the embedded secure element, through the simulated libese_qv_hal.so =="
+session_start eSE1
+step "init: the daemon opens the eSE and reports connected" '^state=true$' init \
+  "phQvEse_init_open"
+step "is a card there?" '^present=true$' present
+step "ATR (the eSE front gives none)" '^atr=\(empty\)$' atr
+step "open a logical channel to the echo applet" '^SUCCESS channel=[1-3] select=6F' "open $ECHO" \
+  "Select AID response"
+e=$(channel)
+step "an APDU on it: data back with 90 00" '^AA BB CC 90 00' "transmit $(cla_of "$e") 01 00 00 03 AA BB CC"
+step "wrong Le: the card says 6C 02, secli resends with Le 02" '^AB CD 90 00' \
+  "transmit $(cla_of "$e") 01 00 00 02 AB CD 05"
+step "open a channel to an applet whose answers come in parts" '^SUCCESS channel=[1-3] select=6F' \
+  "open $BIG"
+b=$(channel)
+step "32 bytes left for GET RESPONSE: 61 20, fetched by secli on channel $b" \
+  '^00 01 02 03 .* 1E 1F 90 00' "transmit $(cla_of "$b") 11 00 20 00"
+step "close the echo channel" '^SUCCESS$' "close $e"
+step "close the other one" '^SUCCESS$' "close $b"
+step "an applet the card does not have" '^NO_SUCH_ELEMENT_ERROR' "open $NONE"
+step "the basic channel to the echo applet" '^SUCCESS select=6F' "basic $ECHO"
+step "an APDU on the basic channel" '^12 34 90 00' "transmit 00 01 00 00 02 12 34"
+session_end
+
+# ---- SIM1 ---------------------------------------------------------------------------
+echo
+echo "== SIM1: the SIM card, through AT commands to modem-sim =="
+session_start SIM1
+step "init: the worker for the modem starts, the port is opened" '^state=true$' init \
+  "init_at_channel"
+step "is a card there?" '^present=true$' present "CARDTYPE" "CARDTYPE"
+step "ATR" '^atr=3B' atr "" "CARDATR"
+step "open a logical channel to the echo applet" \
+  '^SUCCESS channel=[0-9]+ select=6F' "open $ECHO" "AT\+CCHP" "AT\+CCHP"
+e=$(channel)
+step "an APDU on it: the daemon's log masks the command, the modem sees it" \
+  '^AA BB CC 90 00' "transmit $(cla_of "$e") 01 00 00 03 AA BB CC" "AT\+CGLA" "^< AT\+CGLA"
+step "wrong Le: 6C 02, resent with Le 02" '^AB CD 90 00' "transmit $(cla_of "$e") 01 00 00 02 AB CD 05"
+step "open a channel to the applet that answers in parts: its SELECT says 61 1C" \
+  '^SUCCESS channel=[0-9]+ select=61 ?1C' "open $BIG"
+b=$(channel)
+step "the SIM front hands 61 xx to its client, which fetches the FCI itself" \
+  '^6F 1A .* 90 00' "transmit $(cla_of "$b") C0 00 00 1C"
+step "32 bytes left for GET RESPONSE: 61 20, fetched by secli on channel $b" \
+  '^00 01 02 03 .* 1E 1F 90 00' "transmit $(cla_of "$b") 11 00 20 00"
+step "close the echo channel" '^SUCCESS$' "close $e" "" "^< AT\+CCHC"
+step "close the other one" '^SUCCESS$' "close $b"
+step "an applet the card does not have" '^NO_SUCH_ELEMENT_ERROR' "open $NONE" "" "CME ERROR"
+step "the basic channel: SIM1 refuses it, CHANNEL_NOT_AVAILABLE is the right answer" \
+  '^CHANNEL_NOT_AVAILABLE' "basic $ECHO" "openBasicChannel"
+step "APDUs on the basic channel itself still go through, by AT+CSIM" '^9F 7F .*90 00' \
+  "transmit 00 CA 9F 7F 00" "" "^< AT\+CSIM"
+if [ "$two_modems" = 1 ]; then
+  echo
+  echo "  # NFC switched to SIM 2 (sys/nfc/nfc_sim_switch 2, nfc_card_num 3): the next call goes to modem 1"
+  echo 3 >"$root/sys/nfc/nfc_card_num"
+  echo 2 >"$root/sys/nfc/nfc_sim_switch"
+  step "ATR, now from modem 1" '^atr=3B 88 80 01 4D 4F 44 45 4D 31 AA$' atr "selectmodem=1"
+  echo 1 >"$root/sys/nfc/nfc_card_num"
+  echo 1 >"$root/sys/nfc/nfc_sim_switch"
+  step "switched back: modem 0 again" '^atr=3B 86' atr "selectmodem=0"
+fi
+session_end
+
+echo
+if [ "$failed" -eq 0 ]; then
+  echo "demo: all $steps steps gave what they should"
+  exit 0
+fi
+echo "demo: $failed of $steps steps did not give what they should (daemon log: $root/daemon.log; --keep keeps it)"
+exit 1

@@ -1,0 +1,138 @@
+#pragma once
+// Shared harness for tests that run the real programs: a temporary device
+// root, child processes on pipes, the daemon, modem-sim and secli. Waits are
+// on what a child writes (a condition its reader thread signals), never on a
+// clock alone. Every child is killed and reaped by its owner's destructor and
+// dies with the test process (parent-death signal) should that crash.
+#include <sys/types.h>
+
+#include <condition_variable>
+#include <memory>
+#include <mutex>
+#include <string>
+#include <thread>
+#include <vector>
+
+namespace se_test {
+
+constexpr int kGenerousMs = 20000;
+
+// The programs under test, as built next to the tests.
+extern const char* const kDaemon;
+extern const char* const kSecli;
+extern const char* const kModemSim;
+
+// A fresh folder to serve as SE_DEVICE_ROOT, removed with everything in it.
+class TempRoot {
+ public:
+  TempRoot();
+  ~TempRoot();
+  TempRoot(const TempRoot&) = delete;
+  TempRoot& operator=(const TempRoot&) = delete;
+
+  const std::string& path() const { return path_; }
+  std::string at(const std::string& rel) const { return path_ + "/" + rel; }
+  // Folders on the way are made as needed.
+  void write(const std::string& rel, const std::string& content) const;
+  void append(const std::string& rel, const std::string& content) const;
+  void property(const std::string& nameValue) const { append("properties", nameValue + "\n"); }
+
+ private:
+  std::string path_;
+};
+
+// Everything a child writes to one pipe.
+class Output {
+ public:
+  explicit Output(int fd);
+  ~Output();
+  Output(const Output&) = delete;
+  Output& operator=(const Output&) = delete;
+
+  std::string text();
+  size_t size();
+  // True once `needle` appears at or after byte `from`.
+  bool waitFor(const std::string& needle, size_t from = 0, int ms = kGenerousMs);
+  // The next complete line at or after byte *pos; *pos moves past it.
+  // False at once when the child's output has ended without one.
+  bool nextLine(size_t* pos, std::string* line, int ms = kGenerousMs);
+  bool waitEof(int ms = kGenerousMs);
+
+ private:
+  void run();
+  int fd_;
+  std::mutex mu_;
+  std::condition_variable cv_;
+  std::string text_;
+  bool eof_ = false;
+  std::thread thread_;
+};
+
+// One child with its standard input, output and error on pipes and
+// SE_DEVICE_ROOT set to `root`.
+class Process {
+ public:
+  Process(const std::vector<std::string>& argv, const std::string& root);
+  ~Process();
+  Process(const Process&) = delete;
+  Process& operator=(const Process&) = delete;
+
+  void write(const std::string& text);
+  void closeStdin();
+  // Sends `sig` and reaps the child; its output is complete afterwards.
+  void stop(int sig);
+  // Exit code once the child ended on its own (128 + signal when killed);
+  // -1 when it did not end within `ms`.
+  int waitExit(int ms = kGenerousMs);
+  bool running();
+  Output& out() { return *out_; }
+  Output& err() { return *err_; }
+
+ private:
+  pid_t pid_ = -1;
+  bool reaped_ = false;
+  int status_ = 0;
+  int stdin_ = -1;
+  std::unique_ptr<Output> out_;
+  std::unique_ptr<Output> err_;
+};
+
+// The daemon; waits until it has registered "SIM1", its last instance.
+std::unique_ptr<Process> startDaemon(const TempRoot& root);
+// modem-sim for modem 0 or 1, logging on its standard error; waits for its
+// ready line.
+std::unique_ptr<Process> startModem(const TempRoot& root, int modem,
+                                    const std::vector<std::string>& extra = {});
+
+// secli reading commands from its standard input, one JSON line back for
+// each, so that a test can use one answer in the next command.
+class SecliSession {
+ public:
+  SecliSession(const TempRoot& root, const std::string& instance,
+               const std::vector<std::string>& extra = {});
+  ~SecliSession();
+  // Sends one command and returns its JSON line.
+  std::string call(const std::string& command, int ms = kGenerousMs);
+  // Sends without waiting; `answer` collects it later.
+  void send(const std::string& command);
+  bool answer(std::string* line, int ms = kGenerousMs);
+  Process& process() { return proc_; }
+
+ private:
+  Process proc_;
+  size_t pos_ = 0;
+};
+
+// Runs one secli command line to its end; its exit code, output in *out.
+int secli(const TempRoot& root, const std::vector<std::string>& args, std::string* out,
+          std::string* err = nullptr);
+
+// The value of `name` in one flat JSON object, quotes removed.
+std::string field(const std::string& json, const std::string& name);
+std::string hexByte(int v);
+size_t countOf(const std::string& text, const std::string& needle);
+// A sanitizer build reports into the process's standard error and may go on
+// running; such a report fails the test.
+void expectNoSanitizerReport(const std::string& who, const std::string& text);
+
+}  // namespace se_test
