@@ -219,6 +219,18 @@ TEST_F(RpcSecurityTest, ForeignPeersCannotUseUpConnectionSlots) {
   // More connections than the host keeps at once, all held open by a child
   // running as nobody, each sending a whole call.
   constexpr int kForeign = 300;
+  // Everything the child needs is made before the fork: this process runs
+  // the host's threads, so the child keeps to plain system calls.
+  Frame f;
+  f.kind = FrameKind::Call;
+  f.id = 1;
+  f.code = 3;  // isCardPresent
+  std::vector<uint8_t> call;
+  ASSERT_TRUE(encodeFrame(f, &call));
+  const std::string path = ::android::host::serviceSocketPath("SIM1");
+  sockaddr_un addr{};
+  addr.sun_family = AF_UNIX;
+  strncpy(addr.sun_path, path.c_str(), sizeof(addr.sun_path) - 1);
   int report[2];
   ASSERT_EQ(pipe(report), 0);
   pid_t pid = fork();
@@ -226,20 +238,16 @@ TEST_F(RpcSecurityTest, ForeignPeersCannotUseUpConnectionSlots) {
   if (pid == 0) {
     close(report[0]);
     if (setgid(65534) != 0 || setuid(65534) != 0) _exit(3);
-    std::vector<int> fds;
-    Frame f;
-    f.kind = FrameKind::Call;
-    f.id = 1;
-    f.code = 3;  // isCardPresent
-    std::vector<uint8_t> call;
-    encodeFrame(f, &call);
-    int answered = 0, refused = 0;
+    int fds[kForeign];
     for (int i = 0; i < kForeign; ++i) {
-      int fd = connectRaw("SIM1");
-      if (fd < 0) _exit(4);
-      fds.push_back(fd);
-      (void)send(fd, call.data(), call.size(), MSG_NOSIGNAL);
+      fds[i] = socket(AF_UNIX, SOCK_STREAM, 0);
+      if (fds[i] < 0 ||
+          connect(fds[i], reinterpret_cast<const sockaddr*>(&addr), sizeof(addr)) != 0) {
+        _exit(4);
+      }
+      (void)send(fds[i], call.data(), call.size(), MSG_NOSIGNAL);
     }
+    int answered = 0, refused = 0;
     for (int fd : fds) {
       char buf[64];
       pollfd pfd{fd, POLLIN, 0};
