@@ -160,6 +160,31 @@ TEST_F(EndToEnd, ALostModemFailsSimCallsCleanly) {
   EXPECT_EQ(field(ese.call("close " + std::to_string(e)), "status"), "SUCCESS");
 }
 
+// secli --chain fetches what the card leaves for GET RESPONSE and answers
+// 6C xx, on both instances; --trace shows each exchange.
+TEST_F(EndToEnd, ChainedExchangesOnBothInstances) {
+  ASSERT_NO_FATAL_FAILURE(start());
+  std::string pattern;
+  for (int i = 0; i < 0x20; ++i) pattern += hexByte(i);
+  for (const char* instance : {"eSE1", "SIM1"}) {
+    SecliSession s(root, instance, {"--chain", "--trace"});
+    ASSERT_EQ(field(s.call("init"), "state"), "true") << instance;
+    const std::string open = s.call("open A00000000102");
+    ASSERT_EQ(field(open, "status"), "SUCCESS") << open;
+    const int ch = std::atoi(field(open, "channel").c_str());
+    const std::string cla = hexByte(ch);
+    const std::string big = s.call("transmit " + cla + " 11 00 20 00");
+    EXPECT_EQ(field(big, "response"), pattern + "9000") << instance;
+    EXPECT_EQ(field(big, "exchanges"), "2") << instance;
+    EXPECT_TRUE(s.process().err().waitFor("secli: trace > " + cla + " C0 00 00 20")) << instance;
+    const int echo = openEcho(s);
+    const std::string fixed = s.call("transmit " + hexByte(echo) + " 01 00 00 02 AB CD 05");
+    EXPECT_EQ(field(fixed, "response"), "ABCD9000") << instance;
+    EXPECT_EQ(field(fixed, "exchanges"), "2") << instance;
+    EXPECT_TRUE(s.process().err().waitFor("secli: trace < 6C 02")) << instance;
+  }
+}
+
 TEST_F(EndToEnd, WithoutAnEseOnlySim1IsServed) {
   root.property("vendor.ese_sim.type=0");
   ASSERT_NO_FATAL_FAILURE(start());
