@@ -71,6 +71,10 @@ cleanup() {
 }
 trap cleanup EXIT
 trap 'exit 130' INT TERM
+# Children die with this script even when it is killed outright, where
+# setpriv can arrange it.
+pd=()
+setpriv --help 2>&1 | grep -q pdeathsig && pd=(setpriv --pdeathsig KILL --)
 
 # Waits up to 10 s until FILE holds TEXT.
 wait_for() {
@@ -103,7 +107,7 @@ session_start() {
   err_file=$root/secli-$1.err
   : >"$err_file"
   trace_seen=0
-  coproc SECLI { exec "$bin/secli" --root "$root" --chain --trace --timeout 20 -i "$1" -f - 2>"$err_file"; }
+  coproc SECLI { exec "${pd[@]}" "$bin/secli" --root "$root" --chain --trace --timeout 20 -i "$1" -f - 2>"$err_file"; }
   pids+=("$SECLI_PID")
   out_fd=${SECLI[0]}
 }
@@ -181,18 +185,18 @@ echo 0 >"$root/sys/nfc/nfc_wired_ese_type"
 echo "Secure element service demo"
 echo "device root: $root"
 echo
-"$bin/modem-sim" --root "$root" --modem 0 --log "$root/modem0.log" >"$root/modem0.out" 2>&1 &
+"${pd[@]}" "$bin/modem-sim" --root "$root" --modem 0 --log "$root/modem0.log" >"$root/modem0.out" 2>&1 &
 pids+=($!)
 wait_for "$root/modem0.out" "ready" || exit 1
 echo "modem-sim:   modem 0 on $root/dev/appvcom18 (log: modem0.log)"
 if [ "$two_modems" = 1 ]; then
-  "$bin/modem-sim" --root "$root" --modem 1 --atr 3B8880014D4F44454D31AA --log "$root/modem1.log" \
+  "${pd[@]}" "$bin/modem-sim" --root "$root" --modem 1 --atr 3B8880014D4F44454D31AA --log "$root/modem1.log" \
     >"$root/modem1.out" 2>&1 &
   pids+=($!)
   wait_for "$root/modem1.out" "ready" || exit 1
   echo "modem-sim:   modem 1 on $root/dev/appvcom34 (log: modem1.log)"
 fi
-SE_DEVICE_ROOT=$root "$bin/qvese@1.0-service" 2>"$root/daemon.log" &
+SE_DEVICE_ROOT=$root "${pd[@]}" "$bin/qvese@1.0-service" 2>"$root/daemon.log" &
 pids+=($!)
 wait_for "$root/daemon.log" "Registered sim1 success" || exit 1
 echo "daemon:      qvese@1.0-service, instances: $("$bin/secli" --root "$root" list | tr '\n' ' ')(log: daemon.log)"
