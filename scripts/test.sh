@@ -10,9 +10,10 @@
 #                            sanitizer (build/). The plain pass comes last, so
 #                            the output ends with its ctest summary.
 #
-# Environment: BUILD_DIR (plain pass folder), SE_SANITIZE (plain mode only:
-# build that one pass with a sanitizer), FUZZ_SECONDS (per target, default
-# 30), JOBS (default: the number of cores).
+# Environment: BUILD_DIR (plain pass folder), ASAN_DIR, TSAN_DIR, FUZZ_DIR
+# (the other passes' folders), SE_SANITIZE (plain mode only: build that one
+# pass with a sanitizer), FUZZ_SECONDS (per target, default 30), JOBS
+# (default: the number of cores).
 set -euo pipefail
 cd "$(dirname "$0")/.."
 
@@ -41,10 +42,11 @@ if [ "$(cat /proc/sys/vm/mmap_rnd_bits 2>/dev/null || echo 0)" -gt 28 ]; then
 fi
 
 stamp "fuzz: build"
-if CC=clang CXX=clang++ cmake -S . -B build-fuzz -DSE_FUZZ=ON -DSE_SANITIZE=address >/dev/null &&
-   cmake --build build-fuzz -j"$jobs" --target fuzz_all >/dev/null; then
+fuzz_dir=${FUZZ_DIR:-build-fuzz}
+if CC=clang CXX=clang++ cmake -S . -B "$fuzz_dir" -DSE_FUZZ=ON -DSE_SANITIZE=address >/dev/null &&
+   cmake --build "$fuzz_dir" -j"$jobs" --target fuzz_all >/dev/null; then
   stamp "fuzz: ${FUZZ_SECONDS:-30} s per target"
-  fuzz/run.sh -b build-fuzz -t "${FUZZ_SECONDS:-30}" -j "$jobs" || failed+=(fuzz)
+  fuzz/run.sh -b "$fuzz_dir" -t "${FUZZ_SECONDS:-30}" -j "$jobs" || failed+=(fuzz)
 else
   failed+=(fuzz-build)
 fi
@@ -61,8 +63,8 @@ pass() {  # name, build dir, sanitizer, [wrapper...]
   "$@" ctest --test-dir "$dir" --output-on-failure -j"$jobs" --timeout 300 || failed+=("$name")
 }
 
-pass address build-asan address
-pass thread build-tsan thread "${tsan_wrap[@]}"
+pass address "${ASAN_DIR:-build-asan}" address
+pass thread "${TSAN_DIR:-build-tsan}" thread "${tsan_wrap[@]}"
 if [ ${#failed[@]} -ne 0 ]; then echo "=== failed so far: ${failed[*]}"; fi
 pass plain "${BUILD_DIR:-build}" ""
 # Nothing is printed after the last ctest summary; the status tells the rest.
