@@ -47,17 +47,18 @@ TEST(ClaCoding, ChannelFromClassByte) {
   }
 }
 
-TEST(ClaCoding, ClaForChannelRoundTripsAndKeepsProprietaryBit) {
-  for (uint8_t base : {uint8_t(0x00), uint8_t(0x80), uint8_t(0x45), uint8_t(0xC3)}) {
-    for (int ch = 0; ch < se_card::kMaxChannels; ++ch) {
-      uint8_t cla = se_card::claForChannel(base, ch);
-      EXPECT_EQ(se_card::channelFromCla(cla), ch);
-      EXPECT_EQ(cla & 0x80, base & 0x80);
-    }
+TEST(ClaCoding, ClaForChannelKeepsProprietaryAndSecureMessagingBits) {
+  struct Case {
+    uint8_t base;
+    int channel;
+    uint8_t cla;
+  } cases[] = {
+      {0x00, 3, 0x03}, {0x00, 9, 0x45}, {0x80, 7, 0xC3}, {0xC3, 19, 0xCF},
+      {0x0C, 2, 0x0A}, {0x0C, 5, 0x61}, {0xFF, 3, 0xFF}, {0x00, 20, 0x00},
+  };
+  for (const Case& c : cases) {
+    EXPECT_EQ(se_card::claForChannel(c.base, c.channel), c.cla) << int(c.base) << " ch " << c.channel;
   }
-  EXPECT_EQ(se_card::claForChannel(0x00, 9), 0x45);
-  EXPECT_EQ(se_card::claForChannel(0x80, 7), 0xC3);
-  EXPECT_EQ(se_card::claForChannel(0xFF, 3), 0xFF);
 }
 
 TEST(VirtualCardTest, ManageChannelOpenUntilExhaustedThenCloseAndReuse) {
