@@ -8,40 +8,15 @@
 #include "ese_test_util.h"
 
 using namespace ese_test;
-using ::android::hardware::secure_element::V1_0::implementation::setBufferAllocFailureForTest;
-using Status = SecureElementStatus;
-using Calls = std::vector<std::string>;
 
 namespace {
 
-class EseChannels : public ::testing::Test {
+class EseChannels : public EseFixture {
  protected:
-  void SetUp() override {
-    fake_ese::reset();
-    setBufferAllocFailureForTest(0);
-    se = new SecureElement();
-    sweepFlags(se);
-    cap.clear();
-  }
-  // Which of channels 1..3 are still flagged, seen the only way the front
-  // shows it: an init whose ready status is 0 closes exactly those.
-  std::vector<uint8_t> flaggedChannels() {
-    fake_ese::clearCalls();
-    sp<FakeClient> client = new FakeClient();
-    for (int i = 0; i < 3; ++i) fake_ese::queueTransceive({0, {}, 0x90, 0x00});
-    se->init(client);
-    std::vector<uint8_t> out;
-    for (uint8_t c = 1; c <= 3; ++c) {
-      for (const auto& line : fake_ese::calls())
-        if (line == closeLine(c)) out.push_back(c);
-    }
-    return out;
-  }
-  ::android::host::LogCapture cap;
-  sp<SecureElement> se;
+  std::vector<uint8_t> flaggedChannels() { return sweepFlags(se); }
 };
 
-// ---- MANAGE CHANNEL open: the reply decides the channel (Table B) ----
+// ---- MANAGE CHANNEL open: the reply decides the channel ----
 
 struct ManageRow {
   const char* name;
@@ -67,7 +42,6 @@ TEST_F(EseChannels, ManageChannelRefusalsGiveNoChannelAndPowerOff) {
       // Mended: channels above 3 cannot be addressed by CLA = channel nor kept
       // in the table; they are refused and the power-off releases them.
       {"channel 4", {0, {0x04, 0x90, 0x00}}, 0xFF, Status::CHANNEL_NOT_AVAILABLE, {0x04, 0x90, 0x00}},
-      {"channel 19", {0, {0x13, 0x90, 0x00}}, 0xFF, Status::CHANNEL_NOT_AVAILABLE, {0x13, 0x90, 0x00}},
       {"channel 255", {0, {0xFF, 0x90, 0x00}}, 0xFF, Status::CHANNEL_NOT_AVAILABLE, {0xFF, 0x90, 0x00}},
       // The exchange itself failed: marker 7E; bytes it left still become the
       // select response.
@@ -142,26 +116,26 @@ TEST_F(EseChannels, P2_7FBecomes00OnLogicalChannelsOnly) {
   EXPECT_EQ(fake_ese::calls(), (Calls{"ready", selectLine(0x00, 0x04)}));
 }
 
-// ---- SELECT replies (Table C), both channel kinds ----
+// ---- SELECT replies, both channel kinds ----
 
-struct SelectRow {
-  uint8_t sw1, sw2;
-  Status status;
-};
-
-const std::vector<SelectRow> kSelectRows = {
-    {0x90, 0x00, Status::SUCCESS},
-    {0x67, 0x00, Status::NO_SUCH_ELEMENT_ERROR},
-    {0x6A, 0x82, Status::NO_SUCH_ELEMENT_ERROR},
-    {0x6A, 0x86, Status::UNSUPPORTED_OPERATION},
-    {0x6A, 0x81, Status::FAILED},
-    {0x62, 0x83, Status::FAILED},
-    {0x90, 0x01, Status::FAILED},
-};
-
-TEST_F(EseChannels, LogicalSelectStatusWordsAndTheCloseAfterAFailure) {
-  for (const auto& row : kSelectRows) {
+TEST_F(EseChannels, SelectStatusWordsAndTheCleanUpAfterAFailure) {
+  struct Row {
+    uint8_t sw1, sw2;
+    Status status;
+  };
+  const std::vector<Row> rows = {
+      {0x90, 0x00, Status::SUCCESS},
+      {0x67, 0x00, Status::NO_SUCH_ELEMENT_ERROR},
+      {0x6A, 0x82, Status::NO_SUCH_ELEMENT_ERROR},
+      {0x6A, 0x86, Status::UNSUPPORTED_OPERATION},
+      {0x6A, 0x81, Status::FAILED},
+      {0x62, 0x83, Status::FAILED},
+      {0x90, 0x01, Status::FAILED},
+  };
+  for (const auto& row : rows) {
     SCOPED_TRACE(hex2(row.sw1) + hex2(row.sw2));
+    const bool ok = row.status == Status::SUCCESS;
+    // Logical: a failed SELECT closes the channel, then powers off.
     fake_ese::reset();
     cap.clear();
     fake_ese::queueIpc({0, {0x02, 0x90, 0x00}});
@@ -173,33 +147,24 @@ TEST_F(EseChannels, LogicalSelectStatusWordsAndTheCloseAfterAFailure) {
     EXPECT_EQ(r.status, row.status);
     EXPECT_EQ(r.select, (Bytes{0xAB, row.sw1, row.sw2}));
     Calls expected{"ready", kManageOpen, selectLine(0x02, 0x00)};
-    if (row.status != Status::SUCCESS) {
-      expected.push_back(closeLine(2));
-      expected.push_back(kPowerOff);
-      EXPECT_TRUE(logged(cap, "openLogicalChannel select return fail,try to close channel 2",
-                         ANDROID_LOG_DEBUG));
-      EXPECT_FALSE(logged(cap, "openLogicalChannel select return fail,close channel fail ",
-                          ANDROID_LOG_ERROR));
-    }
+    if (!ok) expected.insert(expected.end(), {closeLine(2), kPowerOff});
     EXPECT_EQ(fake_ese::calls(), expected);
-  }
-}
+    EXPECT_EQ(logged(cap, "openLogicalChannel select return fail,try to close channel 2",
+                     ANDROID_LOG_DEBUG), !ok);
+    EXPECT_FALSE(logged(cap, "openLogicalChannel select return fail,close channel fail ",
+                        ANDROID_LOG_ERROR));
 
-TEST_F(EseChannels, BasicSelectStatusWordsAndThePowerOffAfterAFailure) {
-  for (const auto& row : kSelectRows) {
-    SCOPED_TRACE(hex2(row.sw1) + hex2(row.sw2));
+    // Basic: a failed SELECT only powers off.
     fake_ese::reset();
     fake_ese::queueTransceive({0, {0xAB, 0xCD}, row.sw1, row.sw2});
-    BasicResult r = openBasic(se, kAid, 0x00);
-    EXPECT_EQ(r.calls, 1);
-    EXPECT_EQ(r.status, row.status);
-    EXPECT_EQ(r.select, (Bytes{0xAB, 0xCD, row.sw1, row.sw2}));
-    Calls expected{"ready", selectLine(0x00, 0x00)};
-    if (row.status != Status::SUCCESS) expected.push_back(kPowerOff);
+    BasicResult b = openBasic(se, kAid, 0x00);
+    EXPECT_EQ(b.calls, 1);
+    EXPECT_EQ(b.status, row.status);
+    EXPECT_EQ(b.select, (Bytes{0xAB, 0xCD, row.sw1, row.sw2}));
+    expected = {"ready", selectLine(0x00, 0x00)};
+    if (!ok) expected.push_back(kPowerOff);
     EXPECT_EQ(fake_ese::calls(), expected);
   }
-  // The basic channel is never tracked.
-  EXPECT_TRUE(flaggedChannels().empty());
 }
 
 TEST_F(EseChannels, FailedSelectExchangeOnLogicalChannelKeepsManageReplyAndCloses) {
@@ -241,29 +206,27 @@ TEST_F(EseChannels, FailedBasicSelectExchangeGivesMarker7EWithTheStatusWordLeft)
   }
 }
 
-// ---- GET RESPONSE after 61xx (Table D) ----
+// ---- GET RESPONSE after 61xx, fetched once on the channel of the SELECT ----
 
-struct GetResponseRow {
-  const char* name;
-  fake_ese::IpcReply reply;
-  Status logical;
-  Status basic;
-};
-
-const std::vector<GetResponseRow> kGetResponseRows = {
-    {"9000", {0, {0x6F, 0x10, 0x90, 0x00}}, Status::SUCCESS, Status::SUCCESS},
-    {"6700", {0, {0x67, 0x00}}, Status::NO_SUCH_ELEMENT_ERROR, Status::NO_SUCH_ELEMENT_ERROR},
-    {"6A86", {0, {0x6A, 0x86}}, Status::UNSUPPORTED_OPERATION, Status::UNSUPPORTED_OPERATION},
-    {"6A82", {0, {0x6A, 0x82}}, Status::FAILED, Status::NO_SUCH_ELEMENT_ERROR},
-    // More data pending is not fetched: there is no second GET RESPONSE.
-    {"6105", {0, {0x01, 0x02, 0x61, 0x05}}, Status::FAILED, Status::FAILED},
-    {"6F00", {0, {0x6F, 0x00}}, Status::FAILED, Status::FAILED},
-    {"one byte", {0, {0x90}}, Status::FAILED, Status::FAILED},
-    {"empty", {0, {}}, Status::FAILED, Status::FAILED},
-};
-
-TEST_F(EseChannels, LogicalSelect61xxFetchesOnceWithGetResponseOnThatChannel) {
-  for (const auto& row : kGetResponseRows) {
+TEST_F(EseChannels, Select61xxFetchesOnceWithGetResponse) {
+  struct Row {
+    const char* name;
+    fake_ese::IpcReply reply;
+    Status logical;
+    Status basic;
+  };
+  const std::vector<Row> rows = {
+      {"9000", {0, {0x6F, 0x10, 0x90, 0x00}}, Status::SUCCESS, Status::SUCCESS},
+      {"6700", {0, {0x67, 0x00}}, Status::NO_SUCH_ELEMENT_ERROR, Status::NO_SUCH_ELEMENT_ERROR},
+      {"6A86", {0, {0x6A, 0x86}}, Status::UNSUPPORTED_OPERATION, Status::UNSUPPORTED_OPERATION},
+      {"6A82", {0, {0x6A, 0x82}}, Status::FAILED, Status::NO_SUCH_ELEMENT_ERROR},
+      // More data pending is not fetched: there is no second GET RESPONSE.
+      {"6105", {0, {0x01, 0x02, 0x61, 0x05}}, Status::FAILED, Status::FAILED},
+      {"6F00", {0, {0x6F, 0x00}}, Status::FAILED, Status::FAILED},
+      {"one byte", {0, {0x90}}, Status::FAILED, Status::FAILED},
+      {"empty", {0, {}}, Status::FAILED, Status::FAILED},
+  };
+  for (const auto& row : rows) {
     SCOPED_TRACE(row.name);
     fake_ese::reset();
     fake_ese::queueIpc({0, {0x01, 0x90, 0x00}});
@@ -276,30 +239,22 @@ TEST_F(EseChannels, LogicalSelect61xxFetchesOnceWithGetResponseOnThatChannel) {
     EXPECT_EQ(r.status, row.logical);
     EXPECT_EQ(r.select, row.reply.bytes);
     Calls expected{"ready", kManageOpen, selectLine(0x01, 0x00), "ipc 01 C0 00 00 10"};
-    if (row.logical != Status::SUCCESS) {
-      expected.push_back(closeLine(1));
-      expected.push_back(kPowerOff);
-    }
+    if (row.logical != Status::SUCCESS) expected.insert(expected.end(), {closeLine(1), kPowerOff});
+    EXPECT_EQ(fake_ese::calls(), expected);
+
+    fake_ese::reset();
+    fake_ese::queueTransceive({0, {}, 0x61, 0x2A});
+    fake_ese::queueIpc(row.reply);
+    BasicResult b = openBasic(se, kAid, 0x00);
+    EXPECT_EQ(b.calls, 1);
+    EXPECT_EQ(b.status, row.basic);
+    EXPECT_EQ(b.select, row.reply.bytes);
+    expected = {"ready", selectLine(0x00, 0x00), "ipc 00 C0 00 00 2A"};
+    if (row.basic != Status::SUCCESS) expected.push_back(kPowerOff);
     EXPECT_EQ(fake_ese::calls(), expected);
   }
   EXPECT_TRUE(logged(cap, "openLogicalChannel enter! 0x61", ANDROID_LOG_INFO));
   EXPECT_TRUE(logged(cap, "openLogicalChannel enter! 0x900", ANDROID_LOG_ERROR));
-}
-
-TEST_F(EseChannels, BasicSelect61xxFetchesOnceWithGetResponseOnChannelZero) {
-  for (const auto& row : kGetResponseRows) {
-    SCOPED_TRACE(row.name);
-    fake_ese::reset();
-    fake_ese::queueTransceive({0, {}, 0x61, 0x2A});
-    fake_ese::queueIpc(row.reply);
-    BasicResult r = openBasic(se, kAid, 0x00);
-    EXPECT_EQ(r.calls, 1);
-    EXPECT_EQ(r.status, row.basic);
-    EXPECT_EQ(r.select, row.reply.bytes);
-    Calls expected{"ready", selectLine(0x00, 0x00), "ipc 00 C0 00 00 2A"};
-    if (row.basic != Status::SUCCESS) expected.push_back(kPowerOff);
-    EXPECT_EQ(fake_ese::calls(), expected);
-  }
   EXPECT_TRUE(logged(cap, "openBasicChannel enter! 0x61", ANDROID_LOG_INFO));
   EXPECT_TRUE(logged(cap, "openBasicChannel enter! 0x6a82", ANDROID_LOG_INFO));
 }

@@ -11,9 +11,6 @@
 #include "ese_test_util.h"
 
 using namespace ese_test;
-using ::android::hardware::secure_element::V1_0::implementation::setBufferAllocFailureForTest;
-using Status = SecureElementStatus;
-using Calls = std::vector<std::string>;
 
 namespace {
 
@@ -21,19 +18,9 @@ constexpr int kGenerousMs = 5000;
 // How long a call that must stay behind the lock is given to show up anyway.
 constexpr int kMustNotArriveMs = 300;
 
-class EseLifecycle : public ::testing::Test {
+class EseLifecycle : public EseFixture {
  protected:
-  void SetUp() override {
-    fake_ese::reset();
-    setBufferAllocFailureForTest(0);
-    se = new SecureElement();
-    sweepFlags(se);
-    cap.clear();
-    client = new FakeClient();
-  }
-  ::android::host::LogCapture cap;
-  sp<SecureElement> se;
-  sp<FakeClient> client;
+  sp<FakeClient> client = new FakeClient();
 };
 
 // ---- init ----

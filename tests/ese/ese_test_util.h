@@ -9,6 +9,7 @@
 #include <vector>
 
 #include <android/hardware/secure_element/1.0/ISecureElement.h>
+#include <gtest/gtest.h>
 #include <host/log_capture.h>
 
 #include "SecureElement.h"
@@ -25,7 +26,10 @@ using ::android::hardware::secure_element::V1_0::LogicalChannelResponse;
 using ::android::hardware::secure_element::V1_0::SecureElementStatus;
 using ::android::hardware::secure_element::V1_0::implementation::SecureElement;
 
+using ::android::hardware::secure_element::V1_0::implementation::setBufferAllocFailureForTest;
 using Bytes = std::vector<uint8_t>;
+using Calls = std::vector<std::string>;
+using Status = SecureElementStatus;
 
 struct FakeClient : public ISecureElementHalCallback {
   std::atomic<int> connected{0};
@@ -103,10 +107,6 @@ inline bool logged(const ::android::host::LogCapture& cap, const std::string& te
   return false;
 }
 
-}  // namespace ese_test
-
-namespace ese_test {
-
 const Bytes kAid = {0xA0, 0x00, 0x00, 0x01, 0x51};
 
 constexpr const char* kManageOpen = "ipc 00 70 00 00 01";
@@ -136,19 +136,35 @@ inline void scriptOpen(uint8_t c) {
   fake_ese::queueTransceive({0, {}, 0x90, 0x00});
 }
 
-}  // namespace ese_test
-
-namespace ese_test {
-
-// Leaves no channel flagged from an earlier test in the same process: an init
-// whose ready status is 0 closes every flagged channel 1..3. The fake library
-// is reset before and after.
-inline void sweepFlags(const sp<SecureElement>& se) {
+// Which of channels 1..3 are flagged, seen the only way the front shows it:
+// an init whose ready status is 0 closes exactly those, and clears them. The
+// fake library is reset before and after.
+inline std::vector<uint8_t> sweepFlags(const sp<SecureElement>& se) {
   fake_ese::reset();
   for (int i = 0; i < 3; ++i) fake_ese::queueTransceive({0, {}, 0x90, 0x00});
   sp<FakeClient> sweeper = new FakeClient();
   se->init(sweeper);
+  std::vector<uint8_t> closed;
+  for (const auto& line : fake_ese::calls()) {
+    for (uint8_t c = 1; c <= 3; ++c)
+      if (line == closeLine(c)) closed.push_back(c);
+  }
   fake_ese::reset();
+  return closed;
 }
+
+// A fresh front over a reset library, with no channel left flagged.
+class EseFixture : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    fake_ese::reset();
+    ::android::hardware::secure_element::V1_0::implementation::setBufferAllocFailureForTest(0);
+    se = new SecureElement();
+    sweepFlags(se);
+    cap.clear();
+  }
+  ::android::host::LogCapture cap;
+  sp<SecureElement> se;
+};
 
 }  // namespace ese_test

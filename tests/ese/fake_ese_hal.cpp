@@ -72,6 +72,14 @@ void reset() {
   s.blockNext = s.blocked = s.released = false;
 }
 
+namespace {
+template <typename T, typename V>
+void setLocked(T State::*field, V value) {
+  std::lock_guard<std::mutex> l(state().mu);
+  state().*field = value;
+}
+}  // namespace
+
 void queueIpc(const IpcReply& reply) {
   std::lock_guard<std::mutex> l(state().mu);
   state().ipc.push_back(reply);
@@ -80,22 +88,10 @@ void queueTransceive(const TransceiveReply& reply) {
   std::lock_guard<std::mutex> l(state().mu);
   state().trx.push_back(reply);
 }
-void setReadyResult(int32_t rc) {
-  std::lock_guard<std::mutex> l(state().mu);
-  state().readyRc = rc;
-}
-void setReadyStatus(int32_t st) {
-  std::lock_guard<std::mutex> l(state().mu);
-  state().readyStatus = st;
-}
-void setInitOpenResult(int32_t rc) {
-  std::lock_guard<std::mutex> l(state().mu);
-  state().initOpenRc = rc;
-}
-void setEseType(int32_t type) {
-  std::lock_guard<std::mutex> l(state().mu);
-  state().eseType = type;
-}
+void setReadyResult(int32_t rc) { setLocked(&State::readyRc, rc); }
+void setReadyStatus(int32_t st) { setLocked(&State::readyStatus, st); }
+void setInitOpenResult(int32_t rc) { setLocked(&State::initOpenRc, rc); }
+void setEseType(int32_t type) { setLocked(&State::eseType, type); }
 
 std::vector<std::string> calls() {
   std::lock_guard<std::mutex> l(state().mu);
@@ -140,48 +136,27 @@ bool waitForCall(const std::string& line, int timeoutMs) {
 
 using fake_ese::state;
 
+namespace {
+// Records one plain call and answers with `result`.
+int32_t plainCall(const std::string& line, int32_t fake_ese::State::*result = nullptr) {
+  auto& s = state();
+  std::lock_guard<std::mutex> l(s.mu);
+  fake_ese::record(s, line);
+  return result ? s.*result : 0;
+}
+}  // namespace
+
 extern "C" {
 
-int32_t get_korva_exist_flag(void) {
-  auto& s = state();
-  std::lock_guard<std::mutex> l(s.mu);
-  fake_ese::record(s, "type");
-  return s.eseType;
-}
-
-int32_t phQvEse_init_open(void) {
-  auto& s = state();
-  std::lock_guard<std::mutex> l(s.mu);
-  fake_ese::record(s, "open");
-  return s.initOpenRc;
-}
-
-int32_t phQvEse_close(void) {
-  auto& s = state();
-  std::lock_guard<std::mutex> l(s.mu);
-  fake_ese::record(s, "close");
-  return 0;
-}
-
-int32_t phQVNciHal_Set_KORVA_READY(void) {
-  auto& s = state();
-  std::lock_guard<std::mutex> l(s.mu);
-  fake_ese::record(s, "ready");
-  return s.readyRc;
-}
-
+int32_t get_korva_exist_flag(void) { return plainCall("type", &fake_ese::State::eseType); }
+int32_t phQvEse_init_open(void) { return plainCall("open", &fake_ese::State::initOpenRc); }
+int32_t phQvEse_close(void) { return plainCall("close"); }
+int32_t phQVNciHal_Set_KORVA_READY(void) { return plainCall("ready", &fake_ese::State::readyRc); }
 int32_t phQVNciHal_Get_KORVA_Ready_Status(void) {
-  auto& s = state();
-  std::lock_guard<std::mutex> l(s.mu);
-  fake_ese::record(s, "status");
-  return s.readyStatus;
+  return plainCall("status", &fake_ese::State::readyStatus);
 }
-
 int32_t phQVNciHal_Set_KORVA_Power(const char* what) {
-  auto& s = state();
-  std::lock_guard<std::mutex> l(s.mu);
-  fake_ese::record(s, std::string("power ") + (what ? what : "(null)"));
-  return 0;
+  return plainCall(std::string("power ") + (what ? what : "(null)"));
 }
 
 int32_t phQVNciHal_Transmit_APDU_by_IPC(phQvEse_data* cmd, phQvEse_data* rsp) {
