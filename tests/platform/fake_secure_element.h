@@ -173,52 +173,29 @@ class FakeSecureElement : public ISecureElement {
     mReleases += n;
     mCv.notify_all();
   }
-  bool waitEntered(int n) {
-    std::unique_lock<std::mutex> lk(mLock);
-    return mCv.wait_for(lk, kWaitLimit, [&] { return mEntered >= n; });
-  }
   // True if `n` calls entered within `window`; for checking that one does not.
   bool enteredWithin(int n, std::chrono::milliseconds window) {
     std::unique_lock<std::mutex> lk(mLock);
     return mCv.wait_for(lk, window, [&] { return mEntered >= n; });
   }
+  bool waitEntered(int n) { return enteredWithin(n, kWaitLimit); }
   bool waitInit() {
     std::unique_lock<std::mutex> lk(mLock);
     return mCv.wait_for(lk, kWaitLimit, [&] { return mInits > 0; });
   }
-  sp<ISecureElementHalCallback> callback() {
+  sp<ISecureElementHalCallback> callback() { return locked(mCallback); }
+  int maxRunning() { return locked(mMaxRunning); }
+  std::vector<uint8_t> lastTransmit() { return locked(mLastTransmit); }
+  std::vector<uint8_t> lastAid() { return locked(mLastAid); }
+  uint8_t lastP2() { return locked(mLastP2); }
+  uint8_t lastClose() { return locked(mLastClose); }
+ private:
+  template <typename T>
+  T locked(const T& field) {
     std::lock_guard<std::mutex> g(mLock);
-    return mCallback;
-  }
-  int maxRunning() {
-    std::lock_guard<std::mutex> g(mLock);
-    return mMaxRunning;
-  }
-  std::vector<uint8_t> lastTransmit() {
-    std::lock_guard<std::mutex> g(mLock);
-    return mLastTransmit;
-  }
-  std::vector<uint8_t> lastAid() {
-    std::lock_guard<std::mutex> g(mLock);
-    return mLastAid;
-  }
-  uint8_t lastP2() {
-    std::lock_guard<std::mutex> g(mLock);
-    return mLastP2;
-  }
-  uint8_t lastClose() {
-    std::lock_guard<std::mutex> g(mLock);
-    return mLastClose;
-  }
-  // Drops the callback proxy, so its connection can go away completely.
-  void forgetCallback() {
-    sp<ISecureElementHalCallback> old;  // released after the lock
-    std::lock_guard<std::mutex> g(mLock);
-    old = mCallback;
-    mCallback = nullptr;
+    return field;
   }
 
- private:
   std::mutex mLock;
   std::condition_variable mCv;
   sp<ISecureElementHalCallback> mCallback;

@@ -1,14 +1,18 @@
 #pragma once
-// Shared by the RPC host and secli tests: a temporary device root and an
-// in-process server that serves a FakeSecureElement over the real sockets.
+// Shared by the RPC host and secli tests: a temporary device root, an
+// in-process server that serves a FakeSecureElement over the real sockets,
+// and raw frames for what a proxy would never send.
 #include <hidl/HidlTransportSupport.h>
 #include <host/rpc_host.h>
+#include <host/rpc_wire.h>
 
 #include <poll.h>
 #include <stdlib.h>
 #include <unistd.h>
 
+#include <chrono>
 #include <filesystem>
+#include <future>
 #include <string>
 #include <thread>
 
@@ -41,19 +45,30 @@ class Server {
   Server(const sp<FakeSecureElement>& se, const std::string& name, size_t threads) : mSe(se) {
     ::android::hardware::configureRpcThreadpool(threads, true);
     mStatus = se->registerAsService(name);
-    mJoiner = std::thread([] { ::android::hardware::joinRpcThreadpool(); });
+    std::promise<void> left;
+    mJoinerLeft = left.get_future();
+    mJoiner = std::thread([p = std::move(left)]() mutable {
+      ::android::hardware::joinRpcThreadpool();
+      p.set_value();
+    });
   }
   ~Server() { stop(); }
   void stop() {
     if (mSe != nullptr) mSe->release(1000);  // no call may stay blocked
-    ::android::host::shutdownRpcHostForTest();
-    if (mJoiner.joinable()) mJoiner.join();
+    if (!mJoiner.joinable()) return;
+    // A joiner that comes late starts the pool again after a shutdown; shut
+    // down until it has left.
+    do {
+      ::android::host::shutdownRpcHostForTest();
+    } while (mJoinerLeft.wait_for(std::chrono::milliseconds(100)) != std::future_status::ready);
+    mJoiner.join();
   }
   ::android::status_t status() const { return mStatus; }
 
  private:
   sp<FakeSecureElement> mSe;
   ::android::status_t mStatus;
+  std::future<void> mJoinerLeft;
   std::thread mJoiner;
 };
 
@@ -63,6 +78,20 @@ inline int readByte(int fd) {
   if (poll(&pfd, 1, 10000) != 1) return -1;
   unsigned char b;
   return read(fd, &b, 1) == 1 ? b : -1;
+}
+
+// One whole frame as it goes over the socket.
+inline std::vector<uint8_t> frameBytes(::android::host::rpc::FrameKind kind, uint32_t id,
+                                       uint32_t object, uint32_t code, std::vector<uint8_t> body) {
+  ::android::host::rpc::Frame f;
+  f.kind = kind;
+  f.id = id;
+  f.object = object;
+  f.code = code;
+  f.body = std::move(body);
+  std::vector<uint8_t> out;
+  if (!::android::host::rpc::encodeFrame(f, &out)) out.clear();
+  return out;
 }
 
 }  // namespace fake

@@ -3,20 +3,16 @@
 
 #include <host/rpc_wire.h>
 
+#include "rpc_test_util.h"
+
 namespace {
 
 using namespace ::android::host::rpc;
 
 std::vector<uint8_t> encoded(FrameKind kind, uint32_t id, uint32_t object, uint32_t code,
                              std::vector<uint8_t> body) {
-  Frame f;
-  f.kind = kind;
-  f.id = id;
-  f.object = object;
-  f.code = code;
-  f.body = std::move(body);
-  std::vector<uint8_t> out;
-  EXPECT_TRUE(encodeFrame(f, &out));
+  std::vector<uint8_t> out = fake::frameBytes(kind, id, object, code, std::move(body));
+  EXPECT_FALSE(out.empty());
   return out;
 }
 
