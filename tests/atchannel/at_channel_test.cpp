@@ -3,43 +3,21 @@
 #include <fcntl.h>
 #include <gtest/gtest.h>
 #include <host/log_capture.h>
-#include <poll.h>
 #include <signal.h>
-#include <stdlib.h>
-#include <sys/socket.h>
-#include <termios.h>
-#include <unistd.h>
 
 #include <atomic>
-#include <chrono>
-#include <condition_variable>
-#include <cstring>
-#include <functional>
-#include <mutex>
-#include <string>
-#include <thread>
-#include <vector>
 
-#include "at_tok.h"
 #include "atchannel.h"
+#include "scripted_modem.h"
 #include "se_delay.h"
 
 namespace {
 
+using at_test::eventually;
+using at_test::kGenerous;
+using at_test::ScriptedModem;
 using Clock = std::chrono::steady_clock;
 using std::chrono::milliseconds;
-constexpr milliseconds kGenerous(10000);
-
-// Polls a condition that has no event of its own (log records) until a
-// generous deadline.
-bool eventually(const std::function<bool()>& pred, milliseconds limit = kGenerous) {
-  auto end = Clock::now() + limit;
-  while (Clock::now() < end) {
-    if (pred()) return true;
-    std::this_thread::sleep_for(milliseconds(2));
-  }
-  return pred();
-}
 
 size_t countLogs(const android::host::LogCapture& cap, const std::string& text) {
   return cap.find(text, "atchannel").size();
@@ -70,10 +48,6 @@ struct Unsol {
       return false;
     });
   }
-  bool waitCount(size_t n, milliseconds limit = kGenerous) {
-    std::unique_lock<std::mutex> g(m);
-    return cv.wait_for(g, limit, [&] { return lines.size() >= n; });
-  }
   std::vector<std::pair<std::string, std::string>> snapshot() {
     std::lock_guard<std::mutex> g(m);
     return lines;
@@ -91,131 +65,6 @@ void onUnsol(const char* s, const char* pdu) {
   g_unsol.cv.notify_all();
   if (hook) hook(s);
 }
-
-// The modem end: reads commands (ended by CR), records them and lets the
-// test's script answer each one.
-class FakeModem {
- public:
-  using Script = std::function<void(FakeModem&, const std::string&)>;
-
-  static std::unique_ptr<FakeModem> socketPair() {
-    int sv[2];
-    if (socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, sv) != 0) return nullptr;
-    return std::unique_ptr<FakeModem>(new FakeModem(sv[1], sv[0]));
-  }
-  static std::unique_ptr<FakeModem> pty() {
-    int master = posix_openpt(O_RDWR | O_NOCTTY | O_CLOEXEC);
-    if (master < 0 || grantpt(master) != 0 || unlockpt(master) != 0) return nullptr;
-    int slave = open(ptsname(master), O_RDWR | O_NOCTTY | O_CLOEXEC);
-    if (slave < 0) return nullptr;
-    struct termios t;
-    tcgetattr(slave, &t);
-    cfmakeraw(&t);
-    tcsetattr(slave, TCSANOW, &t);
-    return std::unique_ptr<FakeModem>(new FakeModem(master, slave));
-  }
-
-  ~FakeModem() {
-    char c = 1;
-    ssize_t n = write(stop_[1], &c, 1);
-    (void)n;
-    if (thread_.joinable()) thread_.join();
-    close(fd_);
-    close(stop_[0]);
-    close(stop_[1]);
-  }
-
-  // The channel's end; at_open takes it over.
-  int portFd() const { return port_; }
-  void start(Script script) {
-    script_ = std::move(script);
-    thread_ = std::thread([this] { run(); });
-  }
-  void send(const std::string& bytes) {
-    size_t done = 0;
-    while (done < bytes.size()) {
-      ssize_t n = write(fd_, bytes.data() + done, bytes.size() - done);
-      if (n < 0 && errno == EINTR) continue;
-      if (n <= 0) return;
-      done += static_cast<size_t>(n);
-    }
-  }
-  void shutdownWrite() { shutdown(fd_, SHUT_WR); }
-  std::vector<std::string> commands() {
-    std::lock_guard<std::mutex> g(m_);
-    return commands_;
-  }
-  std::string raw() {
-    std::lock_guard<std::mutex> g(m_);
-    return raw_;
-  }
-  bool waitCommands(size_t n, milliseconds limit = kGenerous) {
-    std::unique_lock<std::mutex> g(m_);
-    return cv_.wait_for(g, limit, [&] { return commands_.size() >= n; });
-  }
-  // True once the channel's end has been closed.
-  bool waitHangup(milliseconds limit = kGenerous) {
-    std::unique_lock<std::mutex> g(m_);
-    return cv_.wait_for(g, limit, [&] { return hungUp_; });
-  }
-
- private:
-  FakeModem(int fd, int port) : fd_(fd), port_(port) {
-    if (pipe2(stop_, O_CLOEXEC) != 0) abort();
-  }
-
-  void run() {
-    std::string pending;
-    for (;;) {
-      struct pollfd pfd[2] = {{fd_, POLLIN, 0}, {stop_[0], POLLIN, 0}};
-      if (poll(pfd, 2, -1) < 0) {
-        if (errno == EINTR) continue;
-        return;
-      }
-      if (pfd[1].revents != 0) return;
-      char buf[4096];
-      ssize_t n = read(fd_, buf, sizeof(buf));
-      if (n <= 0) {
-        {
-          std::lock_guard<std::mutex> g(m_);
-          hungUp_ = true;
-        }
-        cv_.notify_all();
-        // Keep waiting only for the stop signal.
-        struct pollfd s = {stop_[0], POLLIN, 0};
-        poll(&s, 1, -1);
-        return;
-      }
-      pending.append(buf, static_cast<size_t>(n));
-      {
-        std::lock_guard<std::mutex> g(m_);
-        raw_.append(buf, static_cast<size_t>(n));
-      }
-      size_t cr;
-      while ((cr = pending.find('\r')) != std::string::npos) {
-        std::string cmd = pending.substr(0, cr);
-        pending.erase(0, cr + 1);
-        {
-          std::lock_guard<std::mutex> g(m_);
-          commands_.push_back(cmd);
-        }
-        cv_.notify_all();
-        if (script_) script_(*this, cmd);
-      }
-    }
-  }
-
-  int fd_;
-  int port_;
-  int stop_[2];
-  Script script_;
-  std::thread thread_;
-  std::mutex m_;
-  std::condition_variable cv_;
-  std::vector<std::string> commands_;
-  std::string raw_;
-  bool hungUp_ = false;
-};
 
 struct ResponseDeleter {
   void operator()(ATResponse* r) const { at_response_free(r); }
@@ -242,11 +91,11 @@ class Channel : public ::testing::Test {
     se_delay::setDivisorForTest(1);
   }
   // Opens the channel on this thread over a socket pair answered by `script`.
-  void open(FakeModem::Script script, std::unique_ptr<FakeModem> modem = FakeModem::socketPair()) {
+  void open(ScriptedModem::Script script, std::unique_ptr<ScriptedModem> modem = ScriptedModem::socketPair()) {
     modem_ = std::move(modem);
     ASSERT_TRUE(modem_);
     fd_ = modem_->portFd();
-    modem_->start(std::move(script));
+    modem_->setScript(std::move(script));
     ASSERT_EQ(at_open(fd_, onUnsol, 0), 0);
   }
   std::string tagged(const char* dir, const std::string& rest) {
@@ -254,12 +103,12 @@ class Channel : public ::testing::Test {
   }
 
   android::host::LogCapture cap_;
-  std::unique_ptr<FakeModem> modem_;
+  std::unique_ptr<ScriptedModem> modem_;
   int fd_ = -1;
 };
 
-FakeModem::Script answer(const std::string& reply) {
-  return [reply](FakeModem& m, const std::string&) { m.send(reply); };
+ScriptedModem::Script answer(const std::string& reply) {
+  return [reply](ScriptedModem& m, const std::string&) { m.send(reply); };
 }
 
 // A reply the test changes between commands; shared with the modem thread,
@@ -274,9 +123,9 @@ struct SwitchableReply {
     std::lock_guard<std::mutex> g(state->m);
     state->reply = r;
   }
-  FakeModem::Script script(const std::string& suffix = "") const {
+  ScriptedModem::Script script(const std::string& suffix = "") const {
     std::shared_ptr<State> st = state;
-    return [st, suffix](FakeModem& fm, const std::string&) {
+    return [st, suffix](ScriptedModem& fm, const std::string&) {
       std::lock_guard<std::mutex> g(st->m);
       fm.send(st->reply + suffix);
     };
@@ -287,7 +136,7 @@ TEST_F(Channel, SinglelineExchangeOverSocketAndPty) {
   for (bool usePty : {false, true}) {
     SCOPED_TRACE(usePty ? "pty" : "socket pair");
     open(answer("\r\n^CARDTYPE: 1,1,0\r\n\r\nOK\r\n"),
-         usePty ? FakeModem::pty() : FakeModem::socketPair());
+         usePty ? ScriptedModem::pty() : ScriptedModem::socketPair());
     ATResponse* raw = nullptr;
     ASSERT_EQ(at_send_command_singleline("AT^CARDTYPE?", "^CARDTYPE:", &raw), AT_OK);
     ResponsePtr r(raw);
@@ -295,13 +144,6 @@ TEST_F(Channel, SinglelineExchangeOverSocketAndPty) {
     EXPECT_EQ(r->success, 1);
     EXPECT_STREQ(r->final_response, "OK");
     ASSERT_EQ(intermediates(r.get()), std::vector<std::string>{"^CARDTYPE: 1,1,0"});
-    char* cur = r->p_intermediates->text;
-    int32_t a = -1, b = -1, c = -1;
-    ASSERT_EQ(at_tok_start(&cur), 0);
-    EXPECT_EQ(at_tok_nextint(&cur, &a), 0);
-    EXPECT_EQ(at_tok_nextint(&cur, &b), 0);
-    EXPECT_EQ(at_tok_nextint(&cur, &c), 0);
-    EXPECT_EQ(a * 100 + b * 10 + c, 110);
     EXPECT_EQ(modem_->raw(), "AT^CARDTYPE?\r");
     EXPECT_EQ(get_ac_index(), 0);
     EXPECT_TRUE(cap_.contains(tagged(">", "AT^CARDTYPE?\n"), "atchannel"));
@@ -313,7 +155,7 @@ TEST_F(Channel, SinglelineExchangeOverSocketAndPty) {
 }
 
 TEST_F(Channel, AnswerSplitAcrossReadsAndSeveralLinesInOneRead) {
-  open([](FakeModem& m, const std::string& cmd) {
+  open([](ScriptedModem& m, const std::string& cmd) {
     if (cmd.rfind("AT+CCHO=", 0) == 0) {
       // The reader must have handled the first piece before the rest comes.
       m.send("+CREG: 1\r\n+CC");
@@ -335,44 +177,6 @@ TEST_F(Channel, AnswerSplitAcrossReadsAndSeveralLinesInOneRead) {
   ResponsePtr r2(raw);
   EXPECT_EQ(intermediates(r2.get()), std::vector<std::string>{"+CSIM: 4,\"9000\""});
   EXPECT_EQ(r2->success, 1);
-}
-
-TEST_F(Channel, LinesWithoutAPendingCommandAreUnsolicited) {
-  open(nullptr);
-  modem_->send("\r\nOK\r\n+CMT: 5\r\n0891AB\r\n");
-  ASSERT_TRUE(g_unsol.waitCount(2));
-  auto seen = g_unsol.snapshot();
-  EXPECT_EQ(seen[0], std::make_pair(std::string("OK"), std::string("-")));
-  EXPECT_EQ(seen[1], std::make_pair(std::string("+CMT: 5"), std::string("0891AB")));
-  // The second line of a pair is kept out of the log.
-  EXPECT_TRUE(cap_.contains(tagged("<", ": ***"), "atchannel"));
-  EXPECT_FALSE(cap_.contains("0891AB"));
-}
-
-TEST_F(Channel, SecondPrefixedLineIsUnsolicited) {
-  open(answer("^CARDTYPE: 1,1,0\r\n^CARDTYPE: 2,2,2\r\nOK\r\n"));
-  ATResponse* raw = nullptr;
-  ASSERT_EQ(at_send_command_singleline("AT^CARDTYPE?", "^CARDTYPE:", &raw), AT_OK);
-  ResponsePtr r(raw);
-  EXPECT_EQ(intermediates(r.get()), std::vector<std::string>{"^CARDTYPE: 1,1,0"});
-  // Handed out by the reader before the final line.
-  auto seen = g_unsol.snapshot();
-  ASSERT_EQ(seen.size(), 1u);
-  EXPECT_EQ(seen[0].first, "^CARDTYPE: 2,2,2");
-}
-
-TEST_F(Channel, FinalLinesAreCaseSensitivePrefixes) {
-  open(answer("ok\r\nOKAY\r\nOK\r\n"));
-  ATResponse* raw = nullptr;
-  ASSERT_EQ(at_send_command("AT+X", &raw), AT_OK);
-  ResponsePtr r(raw);
-  EXPECT_EQ(r->success, 1);
-  EXPECT_STREQ(r->final_response, "OKAY");
-  // The OK after OKAY arrives with no command pending.
-  ASSERT_TRUE(g_unsol.waitCount(2));
-  auto seen = g_unsol.snapshot();
-  EXPECT_EQ(seen[0].first, "ok");
-  EXPECT_EQ(seen[1].first, "OK");
 }
 
 TEST_F(Channel, ErrorFinalResponses) {
@@ -433,7 +237,7 @@ TEST_F(Channel, TimeoutProbe) {
     g_timeouts = 0;
     g_ulModemId = 1;
     cap_.clear();
-    open([c](FakeModem& m, const std::string& cmd) {
+    open([c](ScriptedModem& m, const std::string& cmd) {
       if (cmd == "AT" && c.answerProbe) m.send("OK\r\n");
     });
     at_set_on_timeout(countTimeout);
@@ -470,7 +274,7 @@ TEST_F(Channel, CloseDuringAWaitEndsItWithChannelClosed) {
 
 TEST_F(Channel, ModemHangupDuringAWaitEndsItWithChannelClosed) {
   se_delay::setDivisorForTest(100);
-  open([](FakeModem& m, const std::string&) { m.shutdownWrite(); });
+  open([](ScriptedModem& m, const std::string&) { m.shutdownWrite(); });
   EXPECT_EQ(at_send_command("AT+X", nullptr), AT_ERROR_CHANNEL_CLOSED);
   EXPECT_TRUE(cap_.contains("atchannel: port stays at end of file", "atchannel"));
   EXPECT_TRUE(eventually([&] { return countLogs(cap_, "< reader close.") == 1; }));
@@ -512,17 +316,9 @@ TEST_F(Channel, ReaderThreadMayNotSend) {
   EXPECT_TRUE(modem_->commands().empty());
 }
 
-TEST_F(Channel, OverlongInputIsDiscardedAndReadingGoesOn) {
-  open(answer("OK\r\n"));
-  modem_->send(std::string(8192, 'A') + "B\r\n");
-  ASSERT_TRUE(g_unsol.waitFor("B"));
-  EXPECT_TRUE(cap_.contains("ERROR: Input line exceeded buffer", "atchannel"));
-  EXPECT_EQ(at_send_command("AT", nullptr), AT_OK);
-}
-
 TEST_F(Channel, FloodOfUnsolicitedLinesWhileACommandWaits) {
   constexpr int kLines = 3000;
-  open([](FakeModem& m, const std::string&) {
+  open([](ScriptedModem& m, const std::string&) {
     std::string flood;
     for (int i = 0; i < kLines; ++i) flood += "+CREG: " + std::to_string(i) + "\r\n";
     flood += std::string(50000, 'Z');  // no line end: discarded in buffer-sized bites
@@ -539,16 +335,18 @@ TEST_F(Channel, FloodOfUnsolicitedLinesWhileACommandWaits) {
   EXPECT_EQ(seen.back().first, "+CGLA: 9,\"XX\"");
 }
 
-TEST_F(Channel, SmsPairDoesNotEndThePendingCommand) {
-  open(answer("+CMT: 1\r\nOK\r\n+CCHO: 7\r\nOK\r\n"));
+TEST_F(Channel, SmsPairsDoNotEndThePendingCommandAndTheirPduIsNotLogged) {
+  open(answer("+CMT: 1\r\nOK\r\n+CDS: 2\r\n0891AB\r\n+CCHO: 7\r\nOK\r\n"));
   ATResponse* raw = nullptr;
   ASSERT_EQ(at_send_command_singleline("AT+CCHO=\"A0000000031010\"", "+CCHO:", &raw), AT_OK);
   ResponsePtr r(raw);
   EXPECT_EQ(intermediates(r.get()), std::vector<std::string>{"+CCHO: 7"});
   auto seen = g_unsol.snapshot();
-  ASSERT_EQ(seen.size(), 1u);
+  ASSERT_EQ(seen.size(), 2u);
   EXPECT_EQ(seen[0], std::make_pair(std::string("+CMT: 1"), std::string("OK")));
-  EXPECT_TRUE(cap_.contains(tagged("<", ": ***\n"), "atchannel"));
+  EXPECT_EQ(seen[1], std::make_pair(std::string("+CDS: 2"), std::string("0891AB")));
+  EXPECT_EQ(cap_.find(tagged("<", ": ***\n"), "atchannel").size(), 2u);
+  EXPECT_FALSE(cap_.contains("0891AB"));
 }
 
 TEST_F(Channel, MaskedAndClearLogLines) {
@@ -583,10 +381,10 @@ TEST_F(Channel, SecondOpenOnAThreadReusesItsContext) {
   // This thread may already hold a record from an earlier test in the same
   // process; either way, no further record may be made from here on.
   const size_t made = countLogs(cap_, "ac is null, will malloc");
-  FakeModem* first = modem_.release();
-  auto second = FakeModem::socketPair();
+  ScriptedModem* first = modem_.release();
+  auto second = ScriptedModem::socketPair();
   ASSERT_TRUE(second);
-  second->start(answer("OK\r\n"));
+  second->setScript(answer("OK\r\n"));
   ASSERT_EQ(at_open(second->portFd(), onUnsol, 1), 0);
   EXPECT_TRUE(cap_.contains("ac is not null", "atchannel"));
   EXPECT_EQ(countLogs(cap_, "ac is null, will malloc"), made);
@@ -600,8 +398,8 @@ TEST_F(Channel, SecondOpenOnAThreadReusesItsContext) {
   // Closed and opened again: the same record serves, commands still work.
   at_close();
   modem_ = std::move(second);
-  auto third = FakeModem::socketPair();
-  third->start(answer("OK\r\n"));
+  auto third = ScriptedModem::socketPair();
+  third->setScript(answer("OK\r\n"));
   ASSERT_EQ(at_open(third->portFd(), onUnsol, 0), 0);
   EXPECT_EQ(at_send_command("AT+TWO", nullptr), AT_OK);
   EXPECT_EQ(third->commands(), std::vector<std::string>{"AT+TWO"});

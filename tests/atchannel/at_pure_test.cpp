@@ -224,9 +224,6 @@ TEST(LineSorting, Table) {
 }
 
 TEST(Masking, WordsAreFoundInTableOrderWithoutRegardToCase) {
-  EXPECT_STREQ(at_mask_words[0], "CRSM");
-  EXPECT_STREQ(at_mask_words[59], "CCHO=");
-  EXPECT_STREQ(at_mask_words[69], "CGCONTRDP");
   struct Case {
     const char* text;
     const char* word;  // null: logged in clear
