@@ -19,11 +19,11 @@ namespace sim_test {
 using Replies = std::vector<std::pair<std::string, std::string>>;
 
 inline FakeModem::Script scriptOf(Replies replies) {
-  return [replies](const std::string& command) {
+  return [replies](FakeModem& modem, const std::string& command) {
     for (const auto& r : replies) {
-      if (command.compare(0, r.first.size(), r.first) == 0) return r.second;
+      if (command.compare(0, r.first.size(), r.first) == 0) return modem.send(r.second);
     }
-    return finalLine("ERROR");
+    modem.send(finalLine("ERROR"));
   };
 }
 
@@ -41,12 +41,12 @@ class EngineTest : public ::testing::Test {
  protected:
   void SetUp() override {
     se_delay::setDivisorForTest(100);
-    modem0_ = std::make_unique<FakeModem>(root_.at("dev/appvcom18"));
-    ASSERT_TRUE(modem0_->ok());
+    modem0_ = modemAt(root_.at("dev/appvcom18"));
+    ASSERT_TRUE(modem0_);
   }
   void startModem1() {
-    modem1_ = std::make_unique<FakeModem>(root_.at("dev/appvcom34"));
-    ASSERT_TRUE(modem1_->ok());
+    modem1_ = modemAt(root_.at("dev/appvcom34"));
+    ASSERT_TRUE(modem1_);
   }
   // Starts the modem's worker and waits for its port to be open.
   void startWorker(int32_t modem) {

@@ -3,6 +3,7 @@
 #include <gtest/gtest.h>
 #include <host/log_capture.h>
 #include <log/log.h>
+#include <pty.h>
 #include <sys/wait.h>
 
 #include <cstdio>
@@ -97,14 +98,14 @@ TEST_F(Engine, InitAtChannelStartsOneWorkerPerModem) {
 
 TEST_F(Engine, PortOpensAtThirdAttempt) {
   se_delay::setDivisorForTest(5);  // 200 ms between attempts
-  sim_test::FakeModem late(root_.at("dev/appvcom34"), /*linkNow=*/false);
-  ASSERT_TRUE(late.ok());
-  late.setScript(scriptOf({{"AT^CARDTYPE?", okLine("^CARDTYPE: 1,1,0")}}));
+  auto late = sim_test::modemAt(root_.at("dev/appvcom34"), /*linkNow=*/false);
+  ASSERT_TRUE(late);
+  late->setScript(scriptOf({{"AT^CARDTYPE?", okLine("^CARDTYPE: 1,1,0")}}));
   LogCapture cap;
   ASSERT_EQ(0, init_at_channel(1));
   EXPECT_EQ(-1, push(1, REQUEST_GET_CARD_PRESENT, {}));  // port not open yet
   ASSERT_TRUE(waitUntil([&] { return cap.contains("openTryCount: 4", kTag); }));
-  late.link();
+  late->link();
   ASSERT_TRUE(waitUntil([] { return atPortOpened[1] == 1; }));
 
   std::vector<android::host::LogRecord> opens = cap.find("cmdloop[1] open[/dev/appvcom34] fd: ", kTag);
@@ -117,7 +118,7 @@ TEST_F(Engine, PortOpensAtThirdAttempt) {
 
   EXPECT_EQ(0, push(1, REQUEST_GET_CARD_PRESENT, {}));
   EXPECT_EQ(1, g_asyncCmd.param);
-  EXPECT_TRUE(late.received("AT^CARDTYPE?"));
+  EXPECT_TRUE(late->received("AT^CARDTYPE?"));
 }
 
 TEST_F(Engine, PortThatNeverOpensEndsTheWorker) {
@@ -287,32 +288,6 @@ TEST_F(Engine, OpenLogicalChannelCommandTexts) {
   }
 }
 
-TEST_F(Engine, OpenErrorsMapCmeCodes) {
-  startWorker(0);
-  struct Case {
-    const char* final;
-    int32_t status;
-    const char* log;
-  };
-  const Case cases[] = {
-      {"+CME ERROR: 716", 3, "request_open_logical_channel, cme_err: 716"},
-      {"+CME ERROR: 717", 2, "request_open_logical_channel, cme_err: 717"},
-      {"+CME ERROR: 760", 5, "request_open_logical_channel, cme_err: 760"},
-      {"+CME ERROR: 10", 1, "request_open_logical_channel, cme_err: 10"},
-      {"ERROR", 1, "request_open_logical_channel, cme_err: -1"},
-  };
-  for (const Case& c : cases) {
-    SCOPED_TRACE(c.final);
-    modem0_->setScript(scriptOf({{"AT+CCH", finalLine(c.final)}}));
-    modem0_->clearCommands();
-    LogCapture cap;
-    ASSERT_EQ(0, push(0, REQUEST_OPEN_LOGICAL_CHANNEL, {0xA0, 0x00}, 0));
-    EXPECT_EQ(c.status, g_asyncCmd.param);
-    EXPECT_TRUE(cap.contains(c.log, kTag));
-    EXPECT_EQ(1u, modem0_->commands().size());  // no SELECT, nothing to close
-  }
-}
-
 // Status of a close of `channel` on modem 0 and the commands it sent.
 int32_t closeOn(int32_t modem, int32_t channel) {
   g_asyncCmd.param = channel;
@@ -401,12 +376,11 @@ TEST_F(Engine, SelectResponseDecoding) {
     std::vector<uint8_t> bytes;
   };
   const Case cases[] = {
-      {"+CGLA: 4,\"6F00\"", 2, {0x6F, 0x00}},
+      // The text decoding is shared with transmit; these are the forms
+      // its table does not hold.
       {"+CGLA: 4,6f00", 2, {0x6F, 0x00}},
       {"+CGLA: 40,\"9000\"", 2, {0x90, 0x00}},  // length lowered to the text
       {"+CGLA: 2,\"9000\"", 1, {0x90}},
-      {"+CGLA: 5,\"6F00AA\"", -1, {}},
-      {"+CGLA: 0,\"\"", 0, {}},
       {"+CGLA: -4,\"9000\"", -1, {}},
   };
   for (const Case& c : cases) {

@@ -130,12 +130,8 @@ TEST_F(Front, OperationsTurnAnswersIntoResults) {
   EXPECT_EQ((std::vector<uint8_t>{0x6A, 0x82}), transmit({0x00, 0xB0, 0x00, 0x00, 0x02}));
   EXPECT_EQ((std::vector<uint8_t>{0x90, 0x00}), transmit({0x01, 0xB0, 0x00, 0x00}));
 
-  // Failures come back as an empty vector.
-  cap.clear();
-  EXPECT_TRUE(transmit({}).empty());
-  EXPECT_TRUE(cap.contains("request_transmit_apdu, datalen 0 is invalid", "QvAtChannel"));
+  // Failures, refused by the push or by the handler, come back empty.
   EXPECT_TRUE(transmit(std::vector<uint8_t>(264, 0)).empty());
-  EXPECT_TRUE(cap.contains("asyncCmdPush, datalen: 264 is invalid", "QvAtChannel"));
   EXPECT_TRUE(transmit({0x02, 0xB0, 0x00, 0x00}).empty());  // channel 2 not open
 
   EXPECT_EQ(SecureElementStatus::SUCCESS, static_cast<SecureElementStatus>(se_->closeChannel(1)));
@@ -159,6 +155,7 @@ TEST_F(Front, OpenLogicalChannelResults) {
     SecureElementStatus status;
     uint8_t channel;
     std::vector<uint8_t> selectResponse;
+    const char* cmeErr = nullptr;  // set when the open itself is refused
   };
   const Case cases[] = {
       {"select response", okLine("+CCHP: 259"), okLine("+CGLA: 6,\"6F9000\""),
@@ -168,19 +165,29 @@ TEST_F(Front, OpenLogicalChannelResults) {
       {"malformed select response", okLine("+CCHP: 261"), okLine("+CGLA: 3,\"900\""),
        SecureElementStatus::SUCCESS, 5, {}},
       {"no such applet", finalLine("+CME ERROR: 716"), "", SecureElementStatus::NO_SUCH_ELEMENT_ERROR,
-       0, {}},
+       0, {}, "716"},
       {"no channel free", finalLine("+CME ERROR: 717"), "", SecureElementStatus::CHANNEL_NOT_AVAILABLE,
-       0, {}},
-      {"card error", finalLine("+CME ERROR: 760"), "", SecureElementStatus::IOERROR, 0, {}},
+       0, {}, "717"},
+      {"card error", finalLine("+CME ERROR: 760"), "", SecureElementStatus::IOERROR, 0, {}, "760"},
+      {"other modem error", finalLine("+CME ERROR: 10"), "", SecureElementStatus::FAILED, 0, {}, "10"},
+      {"plain error", finalLine("ERROR"), "", SecureElementStatus::FAILED, 0, {}, "-1"},
       {"select refused", okLine("+CCHP: 262"), finalLine("ERROR"), SecureElementStatus::FAILED, 0, {}},
   };
   for (const Case& c : cases) {
     SCOPED_TRACE(c.name);
     modem0_->setScript(scriptOf({{"AT+CCHP=", c.open}, {"AT+CGLA=", c.select},
                                  {"AT+CCHC=", finalLine("OK")}}));
+    modem0_->clearCommands();
+    LogCapture cap;
     OpenResult r = open({0xA0, 0x00}, 0x00);
     EXPECT_EQ(1, r.calls);
     EXPECT_EQ(c.status, r.status);
+    if (c.cmeErr) {
+      // A refused open sends no SELECT and has nothing to close.
+      EXPECT_EQ(1u, modem0_->commands().size());
+      EXPECT_TRUE(cap.contains(std::string("request_open_logical_channel, cme_err: ") + c.cmeErr,
+                               "QvAtChannel"));
+    }
     EXPECT_EQ(c.channel, r.response.channelNumber);
     EXPECT_EQ(c.selectResponse, std::vector<uint8_t>(r.response.selectResponse.begin(),
                                                      r.response.selectResponse.end()));

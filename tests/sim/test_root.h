@@ -2,9 +2,9 @@
 // A fresh device root per test: a temporary folder that SE_DEVICE_ROOT
 // points at, removed again at the end.
 #include <stdlib.h>
-#include <sys/stat.h>
 #include <unistd.h>
 
+#include <filesystem>
 #include <fstream>
 #include <string>
 
@@ -21,11 +21,8 @@ class TestRoot {
     makeDir("sys/nfc");
   }
   ~TestRoot() {
-    if (!path_.empty()) {
-      std::string cmd = "rm -rf '" + path_ + "'";
-      int rc = system(cmd.c_str());
-      (void)rc;
-    }
+    std::error_code ec;
+    if (!path_.empty()) std::filesystem::remove_all(path_, ec);
   }
   TestRoot(const TestRoot&) = delete;
   TestRoot& operator=(const TestRoot&) = delete;
@@ -34,12 +31,8 @@ class TestRoot {
   std::string at(const std::string& rel) const { return path_ + "/" + rel; }
 
   void makeDir(const std::string& rel) {
-    std::string p = path_;
-    size_t pos = 0;
-    while (pos != std::string::npos) {
-      pos = rel.find('/', pos + 1);
-      mkdir((p + "/" + rel.substr(0, pos)).c_str(), 0755);
-    }
+    std::error_code ec;
+    std::filesystem::create_directories(at(rel), ec);
   }
   void writeFile(const std::string& rel, const std::string& content) {
     std::ofstream(at(rel), std::ios::trunc) << content;
