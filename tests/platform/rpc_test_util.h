@@ -72,14 +72,6 @@ class Server {
   std::thread mJoiner;
 };
 
-// Reads one byte from `fd`, waiting at most the test limit.
-inline int readByte(int fd) {
-  pollfd pfd{fd, POLLIN, 0};
-  if (poll(&pfd, 1, 10000) != 1) return -1;
-  unsigned char b;
-  return read(fd, &b, 1) == 1 ? b : -1;
-}
-
 // One whole frame as it goes over the socket.
 inline std::vector<uint8_t> frameBytes(::android::host::rpc::FrameKind kind, uint32_t id,
                                        uint32_t object, uint32_t code, std::vector<uint8_t> body) {
