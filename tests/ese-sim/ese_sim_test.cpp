@@ -5,12 +5,11 @@
 #include <unistd.h>
 
 #include <cstring>
-#include <thread>
-#include <filesystem>
-#include <fstream>
 #include <string>
+#include <thread>
 #include <vector>
 
+#include "../platform/test_root.h"
 #include "card_applets.h"
 #include "ese_qv_hal.h"
 
@@ -20,20 +19,11 @@ namespace {
 
 class EseSimTest : public ::testing::Test {
  protected:
-  void SetUp() override {
-    char tmpl[] = "/tmp/ese_sim_test.XXXXXX";
-    ASSERT_NE(mkdtemp(tmpl), nullptr);
-    root_ = tmpl;
-    setenv("SE_DEVICE_ROOT", root_.c_str(), 1);
-    phQvEse_close();  // every test starts from a closed eSE and a fresh card
-  }
-  void TearDown() override {
-    phQvEse_close();
-    std::filesystem::remove_all(root_);
-  }
+  void SetUp() override { phQvEse_close(); }  // a closed eSE and a fresh card
+  void TearDown() override { phQvEse_close(); }
   // Scripts change a property by appending a line; the last one wins.
   void setProp(const std::string& name, const std::string& value) {
-    std::ofstream(root_ + "/properties", std::ios::app) << name << "=" << value << "\n";
+    root_.appendFile("properties", name + "=" + value + "\n");
   }
 
   // The IPC route with a 270-byte buffer, as the daemon gives it.
@@ -49,7 +39,7 @@ class EseSimTest : public ::testing::Test {
     return rc;
   }
 
-  std::string root_;
+  se_test::TestRoot root_;
 };
 
 struct TransceiveResult {

@@ -17,26 +17,11 @@
 #include <thread>
 
 #include "fake_secure_element.h"
+#include "test_root.h"
 
 namespace fake {
 
-class TempRoot {
- public:
-  TempRoot() {
-    char tmpl[] = "/tmp/se-test-XXXXXX";
-    const char* dir = mkdtemp(tmpl);
-    mPath = dir ? dir : "";
-    setenv("SE_DEVICE_ROOT", mPath.c_str(), 1);
-  }
-  ~TempRoot() {
-    std::error_code ec;
-    if (!mPath.empty()) std::filesystem::remove_all(mPath, ec);
-  }
-  const std::string& path() const { return mPath; }
-
- private:
-  std::string mPath;
-};
+using TempRoot = se_test::TestRoot;
 
 // Registers `se` under `name` with a pool of `threads` (the joining thread
 // being one of them) and joins the pool on its own thread.
