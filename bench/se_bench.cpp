@@ -622,7 +622,7 @@ int main(int argc, char** argv) {
   // Start-up, each launch in a fresh root (registration needs no modem).
   std::vector<int64_t> startups;
   for (int i = 0; i < o.startups; ++i) {
-    DeviceRoot root(o.keep);
+    DeviceRoot root(false);
     int64_t t = 0;
     Child d = startDaemon(o, root.path(), &t);
     startups.push_back(t);

@@ -649,14 +649,19 @@ class Host {
       std::lock_guard<std::mutex> g(mLock);
       wakeFd = mWakeRead.get();
     }
+    // Kept across turns: one turn per incoming call, and their storage need
+    // not be allocated anew each time.
+    std::vector<Listener*> listeners;
+    std::vector<pollfd> pfds;
+    std::vector<std::shared_ptr<ServerConn>> keep;
     for (;;) {
-      std::vector<Listener*> listeners;
+      listeners.clear();
       {
         std::lock_guard<std::mutex> g(mLock);
         if (mStopping) break;
         for (auto& l : mListeners) listeners.push_back(l.get());
       }
-      std::vector<pollfd> pfds;
+      pfds.clear();
       pfds.push_back({wakeFd, POLLIN, 0});
       for (auto* l : listeners) pfds.push_back({l->fd.get(), POLLIN, 0});
       for (auto& c : conns) {
@@ -674,7 +679,6 @@ class Host {
         }
       }
       size_t base = 1 + listeners.size();
-      std::vector<std::shared_ptr<ServerConn>> keep;
       keep.reserve(conns.size());
       for (size_t i = 0; i < conns.size(); ++i) {
         short rev = pfds[base + i].revents;
@@ -691,6 +695,7 @@ class Host {
         }
       }
       conns.swap(keep);
+      keep.clear();  // closed connections go now, not at the next turn
       for (size_t i = 0; i < listeners.size(); ++i) {
         if (pfds[1 + i].revents & POLLIN) acceptOne(listeners[i], conns);
       }
