@@ -14,8 +14,9 @@
 //   - one SIM call's modem choice (communication_which_modem, in a helper
 //     process that resolves paths under the same device root);
 //   - start-up: launch until both instances accept connections.
-// The cases run in interleaved rounds so that a burst of load from other
-// processes spreads over all of them instead of skewing one.
+// The cases take turns exchange by exchange, in a shuffled order each turn,
+// so that load from other processes, and the machine's changing wake-up
+// latency, fall on floors and daemon paths alike and the ratios hold.
 #include <dlfcn.h>
 #include <fcntl.h>
 #include <poll.h>
@@ -40,6 +41,7 @@
 #include <functional>
 #include <map>
 #include <optional>
+#include <random>
 #include <sstream>
 #include <string>
 #include <vector>
@@ -88,23 +90,19 @@ int g_errFd = STDERR_FILENO;
 struct Options {
   std::string binDir;
   std::string libDir;
-  size_t eseCount = 4000;  // timed exchanges per eSE case, over all rounds
-  size_t simCount = 2000;  // timed exchanges per SIM case
-  size_t rounds = 5;
+  size_t count = 10000;  // timed exchanges per case
   int startups = 7;
   bool keep = false;
   std::string daemonLog;  // empty: daemon.log in the device root
 };
 
 const char kUsage[] =
-    "usage: se-bench [--bin DIR] [--lib DIR] [--ese N] [--sim N] [--rounds N]\n"
+    "usage: se-bench [--bin DIR] [--lib DIR] [--count N]\n"
     "                [--startups N] [--daemon-log FILE] [--keep]\n"
     "  --bin DIR      folder of qvese@1.0-service, modem-sim, se-bench-select\n"
     "                 (default: this program's folder)\n"
     "  --lib DIR      folder of libese_qv_hal.so (default: DIR/../lib)\n"
-    "  --ese N        timed exchanges per eSE case (default 4000)\n"
-    "  --sim N        timed exchanges per SIM case (default 2000)\n"
-    "  --rounds N     interleaved rounds the exchanges are split into (default 5)\n"
+    "  --count N      timed exchanges per case (default 10000)\n"
     "  --startups N   daemon launches timed for start-up (default 7)\n"
     "  --daemon-log F where the measured daemon's log goes (default: daemon.log\n"
     "                 in its device root; /dev/null shows what logging costs)\n"
@@ -137,12 +135,8 @@ Options parseOptions(int argc, char** argv) {
       o.binDir = value();
     } else if (a == "--lib") {
       o.libDir = value();
-    } else if (a == "--ese") {
-      o.eseCount = static_cast<size_t>(count(1));
-    } else if (a == "--sim") {
-      o.simCount = static_cast<size_t>(count(1));
-    } else if (a == "--rounds") {
-      o.rounds = static_cast<size_t>(count(1));
+    } else if (a == "--count") {
+      o.count = static_cast<size_t>(count(1));
     } else if (a == "--startups") {
       o.startups = static_cast<int>(count(1));
     } else if (a == "--daemon-log") {
@@ -591,24 +585,24 @@ void row(const std::string& what, const Stats& s) {
          s.perSecond);
 }
 
-// Samples of one case gathered over several rounds.
+// Samples of one case.
 struct Series {
   std::vector<int64_t> samples;
-  int64_t totalNanos = 0;
-  Stats stats() const { return se_bench::statsOf(samples, totalNanos); }
+  // Exchanges per second: one over the mean time of an exchange, as if
+  // they ran back to back.
+  Stats stats() const {
+    int64_t sum = 0;
+    for (int64_t v : samples) sum += v;
+    return se_bench::statsOf(samples, sum);
+  }
 };
 
-// Times `count` calls of `op`, which returns false on a wrong answer.
-void timeInto(Series& s, size_t count, const std::string& what, const std::function<bool()>& op) {
-  int64_t start = nowNanos();
-  for (size_t i = 0; i < count; ++i) {
-    int64_t t0 = nowNanos();
-    bool ok = op();
-    s.samples.push_back(nowNanos() - t0);
-    if (!ok) fail("wrong answer: " + what);
-  }
-  s.totalNanos += nowNanos() - start;
-}
+// One case: what it runs (false on a wrong answer) and where its times go.
+struct Probe {
+  std::string name;
+  Series* series;
+  std::function<bool()> op;
+};
 
 }  // namespace
 
@@ -682,42 +676,38 @@ int main(int argc, char** argv) {
 
   Series rpcFloor;
   Series libFloor[2], modemFloor[2], eseTx[2], simTx[2];
-  const size_t eseWarm = std::max<size_t>(o.eseCount / 20, 20);
-  const size_t simWarm = std::max<size_t>(o.simCount / 20, 20);
-  // Untimed warm-up of every path.
-  for (size_t i = 0; i < std::max(eseWarm, simWarm); ++i) {
-    for (int k = 0; k < 2; ++k) {
-      if (i < eseWarm) {
-        (void)ese->isCardPresent();
-        (void)viaRpc(ese, eseCases[k]);
-        (void)lib.transmit(libCases[k].command);
-      }
-      if (i < simWarm) {
-        (void)viaRpc(sim, simCases[k]);
-        ++simCalls;
-        (void)port.command(modemCommands[k], &lines);
-      }
-    }
+  std::vector<Probe> probes;
+  probes.push_back({"isCardPresent", &rpcFloor, [&] {
+                      auto r = ese->isCardPresent();
+                      return r.isOk() && static_cast<bool>(r);
+                    }});
+  for (int k = 0; k < 2; ++k) {
+    probes.push_back({std::string("library ") + libCases[k].name, &libFloor[k],
+                      [&, k] { return lib.transmit(libCases[k].command) == libCases[k].response; }});
+    probes.push_back({std::string("eSE1 ") + eseCases[k].name, &eseTx[k], [&, k] { return viaRpc(ese, eseCases[k]); }});
+    probes.push_back({std::string("modem ") + modemCases[k].name, &modemFloor[k], [&, k] {
+                        return port.command(modemCommands[k], &lines) && lines.size() == 1 &&
+                               lines[0] == modemAnswers[k];
+                      }});
+    probes.push_back({std::string("SIM1 ") + simCases[k].name, &simTx[k], [&, k] {
+                        ++simCalls;
+                        return viaRpc(sim, simCases[k]);
+                      }});
   }
-  const size_t eseRound = (o.eseCount + o.rounds - 1) / o.rounds;
-  const size_t simRound = (o.simCount + o.rounds - 1) / o.rounds;
-  for (size_t round = 0; round < o.rounds; ++round) {
-    timeInto(rpcFloor, eseRound, "isCardPresent", [&] {
-      auto r = ese->isCardPresent();
-      return r.isOk() && static_cast<bool>(r);
-    });
-    for (int k = 0; k < 2; ++k) {
-      timeInto(libFloor[k], eseRound, std::string("library ") + libCases[k].name, [&] {
-        return lib.transmit(libCases[k].command) == libCases[k].response;
-      });
-      timeInto(eseTx[k], eseRound, std::string("eSE1 ") + eseCases[k].name,
-               [&] { return viaRpc(ese, eseCases[k]); });
-      timeInto(modemFloor[k], simRound, std::string("modem ") + modemCases[k].name, [&] {
-        return port.command(modemCommands[k], &lines) && lines.size() == 1 && lines[0] == modemAnswers[k];
-      });
-      timeInto(simTx[k], simRound, std::string("SIM1 ") + simCases[k].name,
-               [&] { return viaRpc(sim, simCases[k]); });
-      simCalls += simRound;
+  for (Probe& p : probes) p.series->samples.reserve(o.count);
+  std::vector<size_t> order(probes.size());
+  for (size_t i = 0; i < order.size(); ++i) order[i] = i;
+  std::mt19937 shuffle(20261206);
+  const size_t warmup = std::max<size_t>(o.count / 20, 20);
+  for (size_t turn = 0; turn < warmup + o.count; ++turn) {
+    std::shuffle(order.begin(), order.end(), shuffle);
+    for (size_t i : order) {
+      Probe& p = probes[i];
+      int64_t t0 = nowNanos();
+      bool ok = p.op();
+      int64_t t = nowNanos() - t0;
+      if (!ok) fail("wrong answer: " + p.name);
+      if (turn >= warmup) p.series->samples.push_back(t);
     }
   }
   const double radioLinesPerCall =
@@ -731,7 +721,7 @@ int main(int argc, char** argv) {
     int p[2];
     if (pipe(p) != 0) fail("pipe");
     const std::string helperLog = root.path() + "/bench-select.log";
-    Child helper({o.binDir + "/se-bench-select", std::to_string(o.simCount)}, root.path(), p[1], helperLog);
+    Child helper({o.binDir + "/se-bench-select", std::to_string(o.count)}, root.path(), p[1], helperLog);
     close(p[1]);
     std::string first = readLine(p[0], 60000);
     std::string second = readLine(p[0], 60000);
