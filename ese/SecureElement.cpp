@@ -99,6 +99,23 @@ size_t boundedLen(const phQvEse_data& rsp, size_t bufSize) {
   return rsp.len < bufSize ? rsp.len : bufSize;
 }
 
+// One exchange over the IPC path: `cmdLen` bytes from `cmdBuf`, the answer
+// into `rspBuf` (kRspBufSize bytes). `*rspLen` gets the answer's length as
+// reported, bounded to that buffer, whatever the return code.
+int32_t transmitByIpc(uint8_t* cmdBuf, size_t cmdLen, uint8_t* rspBuf, size_t* rspLen) {
+  phQvEse_data cmdApdu;
+  phQvEse_data rspApdu;
+  memset_s(&cmdApdu, sizeof(cmdApdu), 0, sizeof(cmdApdu));
+  memset_s(&rspApdu, sizeof(rspApdu), 0, sizeof(rspApdu));
+  cmdApdu.len = static_cast<uint32_t>(cmdLen);
+  cmdApdu.p_data = cmdBuf;
+  rspApdu.len = 0;
+  rspApdu.p_data = rspBuf;
+  const int32_t rc = phQVNciHal_Transmit_APDU_by_IPC(&cmdApdu, &rspApdu);
+  *rspLen = boundedLen(rspApdu, kRspBufSize);
+  return rc;
+}
+
 // SELECT status word, both channel kinds (61xx is handled by the caller).
 SecureElementStatus mapSelectSw(uint8_t sw1, uint8_t sw2) {
   if (sw1 == 0x90 && sw2 == 0x00) return SecureElementStatus::SUCCESS;
@@ -275,17 +292,8 @@ Return<void> SecureElement::transmit(const hidl_vec<uint8_t>& data, transmit_cb 
     return Void();
   }
 
-  phQvEse_data cmdApdu;
-  phQvEse_data rspApdu;
-  memset_s(&cmdApdu, sizeof(cmdApdu), 0, sizeof(cmdApdu));
-  memset_s(&rspApdu, sizeof(rspApdu), 0, sizeof(rspApdu));
-  cmdApdu.len = static_cast<uint32_t>(cmd.size());
-  cmdApdu.p_data = cmdBuf.get();
-  rspApdu.len = 0;
-  rspApdu.p_data = rspBuf.get();
-
-  const int32_t rc = phQVNciHal_Transmit_APDU_by_IPC(&cmdApdu, &rspApdu);
-  const size_t rspLen = boundedLen(rspApdu, kRspBufSize);
+  size_t rspLen = 0;
+  const int32_t rc = transmitByIpc(cmdBuf.get(), cmd.size(), rspBuf.get(), &rspLen);
   hidl_vec<uint8_t> response;
   if (rc == 0) {
     response = bytesOf(rspBuf.get(), rspLen);
@@ -338,17 +346,9 @@ Return<void> SecureElement::openLogicalChannel(const hidl_vec<uint8_t>& aid, uin
 
   const uint8_t manageOpen[kShortApduSize] = {0x00, kInsManageChannel, 0x00, 0x00, 0x01};
   memcpy_s(manageCmd.get(), kShortApduSize, manageOpen, sizeof(manageOpen));
-  phQvEse_data cmdApdu;
-  phQvEse_data rspApdu;
-  memset_s(&cmdApdu, sizeof(cmdApdu), 0, sizeof(cmdApdu));
-  memset_s(&rspApdu, sizeof(rspApdu), 0, sizeof(rspApdu));
-  cmdApdu.len = kShortApduSize;
-  cmdApdu.p_data = manageCmd.get();
-  rspApdu.len = 0;
-  rspApdu.p_data = manageRsp.get();
-
-  const int32_t manageRc = phQVNciHal_Transmit_APDU_by_IPC(&cmdApdu, &rspApdu);
-  const size_t manageLen = boundedLen(rspApdu, kRspBufSize);
+  size_t manageLen = 0;
+  const int32_t manageRc =
+      transmitByIpc(manageCmd.get(), kShortApduSize, manageRsp.get(), &manageLen);
   const uint8_t* manageBytes = manageRsp.get();
   const bool manageHasSw = manageLen >= 2;
   const uint8_t manageSw1 = manageHasSw ? manageBytes[manageLen - 2] : 0;
@@ -429,14 +429,8 @@ Return<void> SecureElement::openLogicalChannel(const hidl_vec<uint8_t>& aid, uin
       }
       const uint8_t getResponse[kShortApduSize] = {channel, kInsGetResponse, 0x00, 0x00, rpdu.sw2};
       memcpy_s(getCmd.get(), kShortApduSize, getResponse, sizeof(getResponse));
-      memset_s(&cmdApdu, sizeof(cmdApdu), 0, sizeof(cmdApdu));
-      memset_s(&rspApdu, sizeof(rspApdu), 0, sizeof(rspApdu));
-      cmdApdu.len = kShortApduSize;
-      cmdApdu.p_data = getCmd.get();
-      rspApdu.len = 0;
-      rspApdu.p_data = getRsp.get();
-      if (phQVNciHal_Transmit_APDU_by_IPC(&cmdApdu, &rspApdu) == 0) {
-        const size_t getLen = boundedLen(rspApdu, kRspBufSize);
+      size_t getLen = 0;
+      if (transmitByIpc(getCmd.get(), kShortApduSize, getRsp.get(), &getLen) == 0) {
         result.selectResponse = bytesOf(getRsp.get(), getLen);
         if (getLen >= 2) {
           const uint8_t sw1 = getRsp.get()[getLen - 2];
@@ -512,16 +506,8 @@ Return<void> SecureElement::openBasicChannel(const hidl_vec<uint8_t>& aid, uint8
       }
       const uint8_t getResponse[kShortApduSize] = {0x00, kInsGetResponse, 0x00, 0x00, rpdu.sw2};
       memcpy_s(getCmd.get(), kShortApduSize, getResponse, sizeof(getResponse));
-      phQvEse_data cmdApdu;
-      phQvEse_data rspApdu;
-      memset_s(&cmdApdu, sizeof(cmdApdu), 0, sizeof(cmdApdu));
-      memset_s(&rspApdu, sizeof(rspApdu), 0, sizeof(rspApdu));
-      cmdApdu.len = kShortApduSize;
-      cmdApdu.p_data = getCmd.get();
-      rspApdu.len = 0;
-      rspApdu.p_data = getRsp.get();
-      const int32_t rc = phQVNciHal_Transmit_APDU_by_IPC(&cmdApdu, &rspApdu);
-      const size_t getLen = boundedLen(rspApdu, kRspBufSize);
+      size_t getLen = 0;
+      const int32_t rc = transmitByIpc(getCmd.get(), kShortApduSize, getRsp.get(), &getLen);
       const uint8_t* bytes = getRsp.get();
       if (rc != 0) {
         std::vector<uint8_t> marked{kMarkerExchangeFailed};
