@@ -69,6 +69,61 @@ bool readStatus(BodyReader& r, SecureElementStatus* status) {
   return true;
 }
 
+// The reply of a call whose result is only whether it ran.
+StubResult doneOrFailed(const details::return_status& r, std::string* error) {
+  return r.isOk() ? StubResult::Replied : failed(error, r);
+}
+
+// Both channel opens take an AID and P2 and nothing more.
+BodyWriter openArgs(const hidl_vec<uint8_t>& aid, uint8_t p2) {
+  BodyWriter args;
+  args.bytes(aid);
+  args.u8(p2);
+  return args;
+}
+
+bool readOpenArgs(BodyReader& in, hidl_vec<uint8_t>* aid, uint8_t* p2) {
+  return in.bytes(aid) && in.u8(p2) && in.finished();
+}
+
+// What every proxy of an interface `I` shares: remoteness, death links to
+// the peer, and the call shapes whose reply carries nothing.
+template <typename I>
+class RemoteProxy : public I, public ProxyBase {
+ public:
+  using ProxyBase::ProxyBase;
+  bool isRemote() const override { return true; }
+
+  Return<bool> linkToDeath(const sp<hidl_death_recipient>& recipient, uint64_t cookie) override {
+    return mPeer->linkToDeath(recipient, cookie, wp<IBase>(this));
+  }
+  Return<bool> unlinkToDeath(const sp<hidl_death_recipient>& recipient) override {
+    return mPeer->unlinkToDeath(recipient, wp<IBase>(this));
+  }
+
+ protected:
+  Status call(uint32_t method, const BodyWriter& args, std::vector<uint8_t>* reply) {
+    return mPeer->call(mObject, method, args, reply);
+  }
+
+  // A call whose reply must be empty; anything in it is a malformed reply.
+  Return<void> callExpectingEmpty(uint32_t method, const BodyWriter& args, const char* op) {
+    std::vector<uint8_t> reply;
+    Status st = call(method, args, &reply);
+    if (!st.isOk()) return st;
+    if (!reply.empty()) return badReply(op);
+    return Void();
+  }
+
+  // A ping: only whether the peer answered counts.
+  Return<void> callPing(uint32_t method) {
+    std::vector<uint8_t> reply;
+    Status st = call(method, BodyWriter(), &reply);
+    if (!st.isOk()) return st;
+    return Void();
+  }
+};
+
 // Collects the result callback of one operation. The first result is kept;
 // another call, or a call after the operation has returned, is logged and
 // dropped, so a faulty implementation can neither corrupt the reply nor
@@ -123,34 +178,17 @@ class ResultSlot {
 };
 
 // Daemon side: the client's callback object.
-class HalCallbackProxy : public ISecureElementHalCallback, public ProxyBase {
+class HalCallbackProxy : public RemoteProxy<ISecureElementHalCallback> {
  public:
-  using ProxyBase::ProxyBase;
-  bool isRemote() const override { return true; }
+  using RemoteProxy::RemoteProxy;
 
   Return<void> onStateChange(bool connected) override {
     BodyWriter args;
     args.u8(connected ? 1 : 0);
-    std::vector<uint8_t> reply;
-    Status st = mPeer->call(mObject, kOnStateChange, args, &reply);
-    if (!st.isOk()) return st;
-    if (!reply.empty()) return badReply("onStateChange");
-    return Void();
+    return callExpectingEmpty(kOnStateChange, args, "onStateChange");
   }
 
-  Return<void> ping() override {
-    std::vector<uint8_t> reply;
-    Status st = mPeer->call(mObject, kCallbackPing, BodyWriter(), &reply);
-    if (!st.isOk()) return st;
-    return Void();
-  }
-
-  Return<bool> linkToDeath(const sp<hidl_death_recipient>& recipient, uint64_t cookie) override {
-    return mPeer->linkToDeath(recipient, cookie, wp<IBase>(this));
-  }
-  Return<bool> unlinkToDeath(const sp<hidl_death_recipient>& recipient) override {
-    return mPeer->unlinkToDeath(recipient, wp<IBase>(this));
-  }
+  Return<void> ping() override { return callPing(kCallbackPing); }
 };
 
 sp<IBase> makeCallbackProxy(const std::shared_ptr<RemotePeer>& peer, uint32_t id) {
@@ -165,13 +203,11 @@ StubResult callbackStub(const sp<IBase>& target, uint32_t method, BodyReader& in
     case kOnStateChange: {
       bool connected;
       if (!in.boolean(&connected) || !in.finished()) return badCall(error, "onStateChange arguments");
-      Return<void> r = cb->onStateChange(connected);
-      return r.isOk() ? StubResult::Replied : failed(error, r);
+      return doneOrFailed(cb->onStateChange(connected), error);
     }
     case kCallbackPing: {
       if (!in.finished()) return badCall(error, "ping arguments");
-      Return<void> r = cb->ping();
-      return r.isOk() ? StubResult::Replied : failed(error, r);
+      return doneOrFailed(cb->ping(), error);
     }
     default:
       return badCall(error, "unknown callback method");
@@ -192,8 +228,7 @@ StubResult secureElementStub(const sp<IBase>& target, uint32_t method, BodyReade
         sp<IBase> proxy = peer->importObject(id, makeCallbackProxy);
         cb = static_cast<ISecureElementHalCallback*>(proxy.get());
       }
-      Return<void> r = se->init(cb);
-      return r.isOk() ? StubResult::Replied : failed(error, r);
+      return doneOrFailed(se->init(cb), error);
     }
     case kGetAtr: {
       if (!in.finished()) return badCall(error, "getAtr arguments");
@@ -222,9 +257,7 @@ StubResult secureElementStub(const sp<IBase>& target, uint32_t method, BodyReade
     case kOpenLogicalChannel: {
       hidl_vec<uint8_t> aid;
       uint8_t p2;
-      if (!in.bytes(&aid) || !in.u8(&p2) || !in.finished()) {
-        return badCall(error, "openLogicalChannel arguments");
-      }
+      if (!readOpenArgs(in, &aid, &p2)) return badCall(error, "openLogicalChannel arguments");
       ResultSlot slot("openLogicalChannel");
       Return<void> r = se->openLogicalChannel(
           aid, p2, [slot](const LogicalChannelResponse& resp, SecureElementStatus status) {
@@ -239,9 +272,7 @@ StubResult secureElementStub(const sp<IBase>& target, uint32_t method, BodyReade
     case kOpenBasicChannel: {
       hidl_vec<uint8_t> aid;
       uint8_t p2;
-      if (!in.bytes(&aid) || !in.u8(&p2) || !in.finished()) {
-        return badCall(error, "openBasicChannel arguments");
-      }
+      if (!readOpenArgs(in, &aid, &p2)) return badCall(error, "openBasicChannel arguments");
       ResultSlot slot("openBasicChannel");
       Return<void> r = se->openBasicChannel(
           aid, p2, [slot](const hidl_vec<uint8_t>& selectResponse, SecureElementStatus status) {
@@ -262,8 +293,7 @@ StubResult secureElementStub(const sp<IBase>& target, uint32_t method, BodyReade
     }
     case kPing: {
       if (!in.finished()) return badCall(error, "ping arguments");
-      Return<void> r = se->ping();
-      return r.isOk() ? StubResult::Replied : failed(error, r);
+      return doneOrFailed(se->ping(), error);
     }
     default:
       return badCall(error, "unknown method");
@@ -271,10 +301,9 @@ StubResult secureElementStub(const sp<IBase>& target, uint32_t method, BodyReade
 }
 
 // Client side: the registered instance.
-class SecureElementProxy : public ISecureElement, public ProxyBase {
+class SecureElementProxy : public RemoteProxy<ISecureElement> {
  public:
-  using ProxyBase::ProxyBase;
-  bool isRemote() const override { return true; }
+  using RemoteProxy::RemoteProxy;
 
   Return<void> init(const sp<ISecureElementHalCallback>& clientCallback) override {
     uint32_t id = 0;
@@ -286,16 +315,12 @@ class SecureElementProxy : public ISecureElement, public ProxyBase {
     }
     BodyWriter args;
     args.u32(id);
-    std::vector<uint8_t> reply;
-    Status st = mPeer->call(mObject, kInit, args, &reply);
-    if (!st.isOk()) return st;
-    if (!reply.empty()) return badReply("init");
-    return Void();
+    return callExpectingEmpty(kInit, args, "init");
   }
 
   Return<void> getAtr(getAtr_cb _hidl_cb) override {
     std::vector<uint8_t> reply;
-    Status st = mPeer->call(mObject, kGetAtr, BodyWriter(), &reply);
+    Status st = call(kGetAtr, BodyWriter(), &reply);
     if (!st.isOk()) return st;
     BodyReader r(reply);
     hidl_vec<uint8_t> atr;
@@ -306,7 +331,7 @@ class SecureElementProxy : public ISecureElement, public ProxyBase {
 
   Return<bool> isCardPresent() override {
     std::vector<uint8_t> reply;
-    Status st = mPeer->call(mObject, kIsCardPresent, BodyWriter(), &reply);
+    Status st = call(kIsCardPresent, BodyWriter(), &reply);
     if (!st.isOk()) return st;
     BodyReader r(reply);
     bool present;
@@ -318,7 +343,7 @@ class SecureElementProxy : public ISecureElement, public ProxyBase {
     BodyWriter args;
     args.bytes(data);
     std::vector<uint8_t> reply;
-    Status st = mPeer->call(mObject, kTransmit, args, &reply);
+    Status st = call(kTransmit, args, &reply);
     if (!st.isOk()) return st;
     BodyReader r(reply);
     hidl_vec<uint8_t> response;
@@ -329,11 +354,9 @@ class SecureElementProxy : public ISecureElement, public ProxyBase {
 
   Return<void> openLogicalChannel(const hidl_vec<uint8_t>& aid, uint8_t p2,
                                   openLogicalChannel_cb _hidl_cb) override {
-    BodyWriter args;
-    args.bytes(aid);
-    args.u8(p2);
+    BodyWriter args = openArgs(aid, p2);
     std::vector<uint8_t> reply;
-    Status st = mPeer->call(mObject, kOpenLogicalChannel, args, &reply);
+    Status st = call(kOpenLogicalChannel, args, &reply);
     if (!st.isOk()) return st;
     BodyReader r(reply);
     LogicalChannelResponse resp;
@@ -348,11 +371,9 @@ class SecureElementProxy : public ISecureElement, public ProxyBase {
 
   Return<void> openBasicChannel(const hidl_vec<uint8_t>& aid, uint8_t p2,
                                 openBasicChannel_cb _hidl_cb) override {
-    BodyWriter args;
-    args.bytes(aid);
-    args.u8(p2);
+    BodyWriter args = openArgs(aid, p2);
     std::vector<uint8_t> reply;
-    Status st = mPeer->call(mObject, kOpenBasicChannel, args, &reply);
+    Status st = call(kOpenBasicChannel, args, &reply);
     if (!st.isOk()) return st;
     BodyReader r(reply);
     hidl_vec<uint8_t> selectResponse;
@@ -368,7 +389,7 @@ class SecureElementProxy : public ISecureElement, public ProxyBase {
     BodyWriter args;
     args.u8(channelNumber);
     std::vector<uint8_t> reply;
-    Status st = mPeer->call(mObject, kCloseChannel, args, &reply);
+    Status st = call(kCloseChannel, args, &reply);
     if (!st.isOk()) return st;
     BodyReader r(reply);
     SecureElementStatus status;
@@ -376,19 +397,7 @@ class SecureElementProxy : public ISecureElement, public ProxyBase {
     return status;
   }
 
-  Return<void> ping() override {
-    std::vector<uint8_t> reply;
-    Status st = mPeer->call(mObject, kPing, BodyWriter(), &reply);
-    if (!st.isOk()) return st;
-    return Void();
-  }
-
-  Return<bool> linkToDeath(const sp<hidl_death_recipient>& recipient, uint64_t cookie) override {
-    return mPeer->linkToDeath(recipient, cookie, wp<IBase>(this));
-  }
-  Return<bool> unlinkToDeath(const sp<hidl_death_recipient>& recipient) override {
-    return mPeer->unlinkToDeath(recipient, wp<IBase>(this));
-  }
+  Return<void> ping() override { return callPing(kPing); }
 };
 
 }  // namespace
