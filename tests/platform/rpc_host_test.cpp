@@ -36,19 +36,6 @@ class ClientCallback : public ISecureElementHalCallback {
   std::mutex mLock;
 };
 
-int connectRaw(const std::string& name) {
-  int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
-  sockaddr_un addr{};
-  addr.sun_family = AF_UNIX;
-  std::string path = ::android::host::serviceSocketPath(name);
-  strncpy(addr.sun_path, path.c_str(), sizeof(addr.sun_path) - 1);
-  if (connect(fd, reinterpret_cast<sockaddr*>(&addr), sizeof(addr)) != 0) {
-    close(fd);
-    return -1;
-  }
-  return fd;
-}
-
 // True when the server ends the connection within the test limit.
 bool closedByServer(int fd) {
   char buf[256];

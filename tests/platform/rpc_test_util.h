@@ -8,9 +8,12 @@
 
 #include <poll.h>
 #include <stdlib.h>
+#include <sys/socket.h>
+#include <sys/un.h>
 #include <unistd.h>
 
 #include <chrono>
+#include <cstring>
 #include <filesystem>
 #include <future>
 #include <string>
@@ -56,6 +59,21 @@ class Server {
   std::future<void> mJoinerLeft;
   std::thread mJoiner;
 };
+
+// A bare connection to the instance `name`'s socket, or -1.
+inline int connectRaw(const std::string& name) {
+  int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+  if (fd < 0) return -1;
+  sockaddr_un addr{};
+  addr.sun_family = AF_UNIX;
+  std::string path = ::android::host::serviceSocketPath(name);
+  strncpy(addr.sun_path, path.c_str(), sizeof(addr.sun_path) - 1);
+  if (connect(fd, reinterpret_cast<sockaddr*>(&addr), sizeof(addr)) != 0) {
+    close(fd);
+    return -1;
+  }
+  return fd;
+}
 
 // One whole frame as it goes over the socket.
 inline std::vector<uint8_t> frameBytes(::android::host::rpc::FrameKind kind, uint32_t id,
