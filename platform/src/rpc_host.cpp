@@ -195,12 +195,11 @@ bool makeDirs(const std::string& dir) {
 
 class ServerConn : public RemotePeer, public std::enable_shared_from_this<ServerConn> {
  public:
-  ServerConn(UniqueFd fd, std::string name, sp<IBase> service, StubFn stub, uid_t uid, pid_t pid)
+  ServerConn(UniqueFd fd, std::string name, sp<IBase> service, StubFn stub, pid_t pid)
       : mFd(std::move(fd)),
         mName(std::move(name)),
         mService(std::move(service)),
         mStub(stub),
-        mUid(uid),
         mPid(pid) {}
 
   int fd() const { return mFd.get(); }
@@ -374,7 +373,6 @@ class ServerConn : public RemotePeer, public std::enable_shared_from_this<Server
   const std::string mName;
   sp<IBase> mService;  // null once closed
   const StubFn mStub;
-  const uid_t mUid;
   const pid_t mPid;
   FrameDecoder mDecoder;  // I/O thread only
   std::mutex mWriteLock;  // keeps frames whole
@@ -595,8 +593,7 @@ class Host {
       service = l->service;
       stub = l->stub;
     }
-    conns.push_back(
-        std::make_shared<ServerConn>(std::move(fd), l->name, service, stub, cred.uid, cred.pid));
+    conns.push_back(std::make_shared<ServerConn>(std::move(fd), l->name, service, stub, cred.pid));
   }
 
   // Reads what is there; false when the connection is to be closed.
