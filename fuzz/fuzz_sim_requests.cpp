@@ -124,33 +124,6 @@ int32_t at_send_command_singleline(const char* command, const char* responsePref
   return answer(command, responsePrefix, pp_outResponse);
 }
 
-void at_response_free(ATResponse* p_response) {
-  if (p_response == nullptr) return;
-  ATResponseLine* l = p_response->p_intermediates;
-  while (l != nullptr) {
-    ATResponseLine* next = l->next;
-    free(l->text);
-    free(l);
-    l = next;
-  }
-  free(p_response->final_response);
-  free(p_response);
-}
-
-int32_t at_get_cme_error(const ATResponse* p_response) {
-  if (p_response == nullptr) return -1;
-  if (p_response->success > 0) return 0;
-  const char* prefix = "+CME ERROR:";
-  if (p_response->final_response == nullptr ||
-      strncmp(p_response->final_response, prefix, strlen(prefix)) != 0) {
-    return -1;
-  }
-  char* cur = p_response->final_response;
-  int32_t value = 0;
-  if (at_tok_start(&cur) < 0 || at_tok_nextint(&cur, &value) < 0) return -1;
-  return value;
-}
-
 int32_t get_ac_index(void) { return g_acIndex; }
 
 // The worker's port handling is not reached from the handlers.
