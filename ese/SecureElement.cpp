@@ -8,6 +8,7 @@
 #include <log/log.h>
 #include <securec.h>
 
+#include "ese_buffer.h"
 #include "ese_qv_hal.h"
 
 namespace android {
@@ -46,8 +47,6 @@ constexpr size_t kTrackedChannels = 4;
 // may be writing them under it.
 std::atomic<int32_t> g_openedChannels[kTrackedChannels];
 
-std::atomic<unsigned> g_allocFailCountdown{0};
-
 struct FreeDeleter {
   void operator()(uint8_t* p) const { std::free(p); }
 };
@@ -56,16 +55,7 @@ using Buffer = std::unique_ptr<uint8_t, FreeDeleter>;
 // A per-call working buffer; never zero bytes long, so an empty command still
 // has somewhere to point.
 Buffer allocBuffer(size_t size, bool zeroFill) {
-  unsigned left = g_allocFailCountdown.load();
-  while (left != 0) {
-    if (g_allocFailCountdown.compare_exchange_weak(left, left - 1)) {
-      if (left == 1) return Buffer();
-      break;
-    }
-  }
-  const size_t n = size == 0 ? 1 : size;
-  Buffer buf(static_cast<uint8_t*>(zeroFill ? std::calloc(n, 1) : std::malloc(n)));
-  return buf;
+  return Buffer(eseBufferAlloc(size == 0 ? 1 : size, zeroFill));
 }
 
 class EseLock {
@@ -210,8 +200,6 @@ SecureElementStatus closeChannelUnlocked(uint8_t channel, const char* op) {
 }
 
 }  // namespace
-
-void setBufferAllocFailureForTest(unsigned nth) { g_allocFailCountdown.store(nth); }
 
 // The eSE lock is built before the SIM front's: both are plain statics, and
 // the priority keeps that order whatever order the linker lays the units in.

@@ -56,10 +56,6 @@ struct SecureElement : public ISecureElement, public hidl_death_recipient {
   static SecureElementStatus internalCloseChannel(uint8_t channelNumber);
 };
 
-// Tests only: the nth working-buffer allocation from now on fails (1 = the
-// next one), so the out-of-memory paths can be driven; 0 turns it off.
-void setBufferAllocFailureForTest(unsigned nth);
-
 }  // namespace implementation
 }  // namespace V1_0
 }  // namespace secure_element

@@ -1,7 +1,10 @@
-// The eSE front's channel operations against the scripted vendor library:
-// the commands sent, the status words mapped, the markers, the closes and
-// power-offs that follow, and the bounds on what the library hands back.
+// The eSE front's channel operations against the scripted vendor library: the
+// commands sent, the status words mapped, the markers, the result delivered
+// before the closes and power-offs that follow it, and the bounds on what the
+// library hands back.
 #include <gtest/gtest.h>
+
+#include <algorithm>
 
 #include <android/log.h>
 
@@ -11,432 +14,209 @@ using namespace ese_test;
 
 namespace {
 
-class EseChannels : public EseFixture {
- protected:
-  std::vector<uint8_t> flaggedChannels() { return sweepFlags(se); }
-};
+using Ipc = fake_ese::IpcReply;
+using Trx = fake_ese::TransceiveReply;
+const std::string R = "ready", M = kManageOpen, CB = "result", P = kPowerOff;
+std::string sel(uint8_t c, uint8_t p2 = 0) { return selectLine(c, p2); }
+std::string getResponse(uint8_t c, uint8_t le) { return "ipc " + hex2(c) + " C0 00 00 " + hex2(le); }
+Bytes operator+(Bytes a, const Bytes& b) {
+  a.insert(a.end(), b.begin(), b.end());
+  return a;
+}
 
-// ---- MANAGE CHANNEL open: the reply decides the channel ----
+constexpr uint8_t kBasic = 0xB0;  // `channel` of a row that opens the basic channel
 
-struct ManageRow {
-  const char* name;
-  fake_ese::IpcReply reply;
-  uint8_t channel;
-  Status status;
+struct OpenRow {
+  std::string name;
+  uint8_t channel;  // the channel delivered, or kBasic
+  std::vector<Ipc> ipc;
+  std::vector<Trx> trx;
   Bytes select;
+  Status status;
+  Calls calls;  // the library calls and the result callback, in order
+  uint8_t p2 = 0;
+  unsigned allocFail = 0;  // which working buffer fails, 0 none
+  int32_t readyRc = 0;
+  std::string log = "";  // a line the call logs at error level
 };
 
-TEST_F(EseChannels, ManageChannelRefusalsGiveNoChannelAndPowerOff) {
-  const std::vector<ManageRow> rows = {
-      {"6A81", {0, {0x6A, 0x81}}, 0xFF, Status::CHANNEL_NOT_AVAILABLE, {0x6A, 0x81}},
-      {"6D00", {0, {0x6D, 0x00}}, 0xFF, Status::UNSUPPORTED_OPERATION, {0x6D, 0x00}},
-      {"6E00", {0, {0x6E, 0x00}}, 0xFF, Status::UNSUPPORTED_OPERATION, {0x6E, 0x00}},
-      {"9001", {0, {0x01, 0x90, 0x01}}, 0xFF, Status::FAILED, {0x01, 0x90, 0x01}},
-      {"6985", {0, {0x69, 0x85}}, 0xFF, Status::FAILED, {0x69, 0x85}},
-      {"empty", {0, {}}, 0xFF, Status::FAILED, {}},
-      // Mended: a one-byte reply is answered like an empty one instead of
-      // leaving the caller without a result.
-      {"one byte", {0, {0x01}}, 0xFF, Status::FAILED, {}},
-      // 90 00 with no channel byte in front of it names no channel.
-      {"9000 alone", {0, {0x90, 0x00}}, 0xFF, Status::FAILED, {0x90, 0x00}},
-      // Mended: channels above 3 cannot be addressed by CLA = channel nor kept
-      // in the table; they are refused and the power-off releases them.
-      {"channel 4", {0, {0x04, 0x90, 0x00}}, 0xFF, Status::CHANNEL_NOT_AVAILABLE, {0x04, 0x90, 0x00}},
-      {"channel 255", {0, {0xFF, 0x90, 0x00}}, 0xFF, Status::CHANNEL_NOT_AVAILABLE, {0xFF, 0x90, 0x00}},
-      // The exchange itself failed: marker 7E; bytes it left still become the
-      // select response.
-      {"ipc failed", {-1, {}}, 0x7E, Status::FAILED, {}},
-      {"ipc failed with SW", {-1, {0x6A, 0x81}}, 0x7E, Status::FAILED, {0x6A, 0x81}},
+const Trx kOk{0, {}, 0x90, 0x00};
+
+std::vector<OpenRow> openRows() {
+  std::vector<OpenRow> rows = {
+      // MANAGE CHANNEL open decides the channel; a refusal delivers 0xFF then powers off.
+      {"6A81", 0xFF, {{0, {0x6A, 0x81}}}, {}, {0x6A, 0x81}, Status::CHANNEL_NOT_AVAILABLE, {R, M, CB, P},
+       0, 0, 0, "openLogicalChannel OpenLogicalChannel 0700 command Respose value 0x6a81"},
+      {"6D00", 0xFF, {{0, {0x6D, 0x00}}}, {}, {0x6D, 0x00}, Status::UNSUPPORTED_OPERATION, {R, M, CB, P}},
+      {"6E00", 0xFF, {{0, {0x6E, 0x00}}}, {}, {0x6E, 0x00}, Status::UNSUPPORTED_OPERATION, {R, M, CB, P}},
+      {"9001", 0xFF, {{0, {1, 0x90, 0x01}}}, {}, {1, 0x90, 0x01}, Status::FAILED, {R, M, CB, P}},
+      {"empty", 0xFF, {{0, {}}}, {}, {}, Status::FAILED, {R, M, CB, P}},
+      // Mended: a one-byte reply is answered like an empty one.
+      {"one byte", 0xFF, {{0, {0x01}}}, {}, {}, Status::FAILED, {R, M, CB, P}},
+      {"9000 without channel", 0xFF, {{0, {0x90, 0x00}}}, {}, {0x90, 0x00}, Status::FAILED, {R, M, CB, P}},
+      // Mended: channels the CLA and the table cannot hold are refused.
+      {"channel 4", 0xFF, {{0, {4, 0x90, 0x00}}}, {}, {4, 0x90, 0x00}, Status::CHANNEL_NOT_AVAILABLE,
+       {R, M, CB, P}},
+      {"ipc failed", 0x7E, {{-1, {0x6A, 0x81}}}, {}, {0x6A, 0x81}, Status::FAILED, {R, M, CB, P},
+       0, 0, 0, "phQVNciHal_Transmit_APDU_by_IPC failed!!!"},
+      {"not ready", 0x7F, {}, {}, {}, Status::IOERROR, {R, CB, P}, 0, 0, -1,
+       "phQVNciHal_Set_KORVA_READY failed!!!"},
+      {"basic not ready", kBasic, {}, {}, {0x7F}, Status::IOERROR, {R, CB, P}, 0, 0, -1},
+      // Success: no power-off; P2 7F becomes 00 on logical channels only.
+      {"open 1", 1, {{0, {1, 0x90, 0x00}}}, {{0, {0x6F, 0x01, 0x84}, 0x90, 0x00}},
+       {0x6F, 0x01, 0x84, 0x90, 0x00}, Status::SUCCESS, {R, M, sel(1, 0x0C), CB}, 0x0C, 0, 0,
+       "openLogicalChannel OpenLogicalChannel Select AID response value 0x900"},
+      {"p2 7F", 2, {{0, {2, 0x90, 0x00}}}, {kOk}, {0x90, 0x00}, Status::SUCCESS, {R, M, sel(2), CB}, 0x7F},
+      {"basic p2 7F", kBasic, {}, {kOk}, {0x90, 0x00}, Status::SUCCESS, {R, sel(0, 0x7F), CB}, 0x7F},
+      // A failed SELECT exchange keeps the MANAGE CHANNEL reply; the failed close is logged.
+      {"select exchange fails", 3, {{0, {3, 0x90, 0x00}}}, {{-1, {}, 0x6A, 0x82}, {-1, {}}}, {3, 0x90, 0x00},
+       Status::FAILED, {R, M, sel(3), CB, closeLine(3), P}, 0, 0, 0,
+       "openLogicalChannel select return fail,close channel fail "},
+      // ... on the basic channel: marker 7E, with the status word the library left.
+      {"basic fails 6A82", kBasic, {}, {{-1, {1, 2}, 0x6A, 0x82}}, {0x7E, 0x6A, 0x82}, Status::FAILED,
+       {R, sel(0), CB, P}},
+      {"basic fails 9000", kBasic, {}, {{-1, {1, 2}, 0x90, 0x00}}, {0x7E}, Status::FAILED, {R, sel(0), CB, P}},
+      {"basic fails 0000", kBasic, {}, {{-1, {}, 0x00, 0x00}}, {0x7E}, Status::FAILED, {R, sel(0), CB, P}},
+      {"basic fails 0001", kBasic, {}, {{-1, {}, 0x00, 0x01}}, {0x7E, 0, 1}, Status::FAILED, {R, sel(0), CB, P}},
+      // A failed GET RESPONSE exchange.
+      {"logical get response fails", 2, {{0, {2, 0x90, 0x00}}, {-1, {0x6A, 0x82}}},
+       {{0, {0x55}, 0x61, 0x08}, kOk}, {0x55, 0x61, 0x08}, Status::FAILED,
+       {R, M, sel(2), getResponse(2, 8), CB, closeLine(2), P}},
+      {"basic get response fails", kBasic, {{-1, {1, 0x6A, 0x82}}}, {{0, {}, 0x61, 0x08}},
+       {0x7E, 0x6A, 0x82}, Status::FAILED, {R, sel(0), getResponse(0, 8), CB, P}},
+      {"basic get response fails short", kBasic, {{-1, {0x6A}}}, {{0, {}, 0x61, 0x08}}, {0x7E},
+       Status::FAILED, {R, sel(0), getResponse(0, 8), CB, P}},
+      // Lengths the library claims are bounded by the buffers (256 for the
+      // basic SELECT, 270 for the rest).
+      {"basic claims 300", kBasic, {}, {{0, Bytes(256, 0x5A), 0x90, 0x00, 300}}, Bytes(256, 0x5A) + Bytes{0x90, 0x00},
+       Status::SUCCESS, {R, sel(0), CB}},
+      {"get response claims 100000", kBasic, {{0, Bytes(270, 0x22), 100000}}, {{0, {}, 0x61, 0x00}},
+       Bytes(270, 0x22), Status::FAILED, {R, sel(0), getResponse(0, 0), CB, P}},
+      {"manage claims 4000", 0xFF, {{0, {1, 0x90, 0x00}, 4000}}, {}, Bytes{1, 0x90, 0x00} + Bytes(267, 0), Status::FAILED,
+       {R, M, CB, P}},
+      // Mended: allocation failures deliver one failure. Before MANAGE CHANNEL
+      // only the close of channel 0 follows (a power-off); after channel 1 is
+      // assigned it stays open and flagged.
+      {"alloc 1", 0, {}, {}, {}, Status::FAILED, {CB, P}, 0, 1, 0, "openLogicalChannel cmdApdu.p_data malloc fail!"},
+      {"alloc 2", 0, {}, {}, {}, Status::FAILED, {CB, P}, 0, 2, 0, "openLogicalChannel rspApdu.p_data malloc fail!"},
+      {"alloc 3", 1, {{0, {1, 0x90, 0x00}}}, {}, {1, 0x90, 0x00}, Status::FAILED, {R, M, CB}, 0, 3, 0,
+       "openLogicalChannel cpdu.pdata malloc fail!"},
+      {"alloc 4", 1, {{0, {1, 0x90, 0x00}}}, {}, {1, 0x90, 0x00}, Status::FAILED, {R, M, CB}, 0, 4},
+      {"alloc 6", 1, {{0, {1, 0x90, 0x00}}}, {{0, {}, 0x61, 0x04}}, {0x61, 0x04}, Status::FAILED,
+       {R, M, sel(1), CB}, 0, 6, 0, "openLogicalChannel rspApdu.p_dataa malloc fail!"},
+      {"basic alloc 1", kBasic, {}, {}, {}, Status::FAILED, {CB}, 0, 1, 0, "openBasicChannel cpdu.pdata malloc fail!"},
+      {"basic alloc 2", kBasic, {}, {}, {}, Status::FAILED, {CB}, 0, 2},
+      {"basic alloc 4", kBasic, {}, {{0, {}, 0x61, 0x04}}, {0x61, 0x04}, Status::FAILED, {R, sel(0), CB}, 0, 4,
+       0, "openBasicChannel rspApdu.p_data malloc fail!"},
   };
-  for (const auto& row : rows) {
-    SCOPED_TRACE(row.name);
-    fake_ese::reset();
-    fake_ese::queueIpc(row.reply);
-    LogicalResult r = openLogical(se, kAid, 0x00);
-    EXPECT_EQ(r.calls, 1);
-    EXPECT_EQ(r.channel, row.channel);
-    EXPECT_EQ(r.status, row.status);
-    EXPECT_EQ(r.select, row.select);
-    EXPECT_EQ(fake_ese::calls(), (Calls{"ready", kManageOpen, kPowerOff}));
+  // SELECT status words, both channel kinds: a failure is delivered, then the
+  // logical channel is closed and the eSE powered off.
+  const std::vector<std::pair<Bytes, Status>> selectSw = {
+      {{0x90, 0x00}, Status::SUCCESS},        {{0x67, 0x00}, Status::NO_SUCH_ELEMENT_ERROR},
+      {{0x6A, 0x82}, Status::NO_SUCH_ELEMENT_ERROR}, {{0x6A, 0x86}, Status::UNSUPPORTED_OPERATION},
+      {{0x6A, 0x81}, Status::FAILED},         {{0x90, 0x01}, Status::FAILED}};
+  for (const auto& [sw, st] : selectSw) {
+    const bool ok = st == Status::SUCCESS;
+    Calls logical{R, M, sel(2), CB}, basic{R, sel(0), CB};
+    if (!ok) {
+      logical.insert(logical.end(), {closeLine(2), P});
+      basic.push_back(P);
+    }
+    rows.push_back({"select " + fake_ese::hex(sw), 2, {{0, {2, 0x90, 0x00}}}, {{0, {0xAB}, sw[0], sw[1]}, kOk},
+                    {0xAB, sw[0], sw[1]}, st, logical});
+    rows.push_back({"basic select " + fake_ese::hex(sw), kBasic, {}, {{0, {0xAB}, sw[0], sw[1]}},
+                    {0xAB, sw[0], sw[1]}, st, basic});
   }
-  EXPECT_TRUE(flaggedChannels().empty());
-  EXPECT_TRUE(logged(cap, "phQVNciHal_Transmit_APDU_by_IPC failed!!!", ANDROID_LOG_ERROR));
-  EXPECT_TRUE(logged(cap, "openLogicalChannel OpenLogicalChannel 0700 command Respose value 0x6a81",
-                     ANDROID_LOG_ERROR));
-}
-
-TEST_F(EseChannels, ReadyFailureGivesMarker7FAndPowerOffOnBothChannelKinds) {
-  fake_ese::setReadyResult(-1);
-  LogicalResult l = openLogical(se, kAid, 0x00);
-  EXPECT_EQ(l.calls, 1);
-  EXPECT_EQ(l.channel, 0x7F);
-  EXPECT_TRUE(l.select.empty());
-  EXPECT_EQ(l.status, Status::IOERROR);
-  EXPECT_EQ(fake_ese::calls(), (Calls{"ready", kPowerOff}));
-
-  fake_ese::clearCalls();
-  BasicResult b = openBasic(se, kAid, 0x00);
-  EXPECT_EQ(b.calls, 1);
-  EXPECT_EQ(b.select, (Bytes{0x7F}));
-  EXPECT_EQ(b.status, Status::IOERROR);
-  EXPECT_EQ(fake_ese::calls(), (Calls{"ready", kPowerOff}));
-  EXPECT_TRUE(logged(cap, "phQVNciHal_Set_KORVA_READY failed!!!", ANDROID_LOG_ERROR));
-}
-
-// ---- A successful logical open ----
-
-TEST_F(EseChannels, LogicalOpenSelectsOnTheAssignedChannelAndKeepsItFlagged) {
-  fake_ese::queueIpc({0, {0x01, 0x90, 0x00}});
-  fake_ese::queueTransceive({0, {0x6F, 0x03, 0x84, 0x01, 0x00}, 0x90, 0x00});
-  LogicalResult r = openLogical(se, kAid, 0x0C);
-  EXPECT_EQ(r.calls, 1);
-  EXPECT_EQ(r.channel, 1);
-  EXPECT_EQ(r.select, (Bytes{0x6F, 0x03, 0x84, 0x01, 0x00, 0x90, 0x00}));
-  EXPECT_EQ(r.status, Status::SUCCESS);
-  // No power-off after a successful open.
-  EXPECT_EQ(fake_ese::calls(), (Calls{"ready", kManageOpen, selectLine(0x01, 0x0C)}));
-  EXPECT_TRUE(logged(cap, "openLogicalChannel OpenLogicalChannel Select AID response value 0x900",
-                     ANDROID_LOG_ERROR));
-  EXPECT_EQ(flaggedChannels(), (std::vector<uint8_t>{1}));
-}
-
-TEST_F(EseChannels, P2_7FBecomes00OnLogicalChannelsOnly) {
-  scriptOpen(2);
-  openLogical(se, kAid, 0x7F);
-  EXPECT_EQ(fake_ese::calls().back(), selectLine(0x02, 0x00));
-
-  fake_ese::clearCalls();
-  fake_ese::queueTransceive({0, {}, 0x90, 0x00});
-  openBasic(se, kAid, 0x7F);
-  EXPECT_EQ(fake_ese::calls(), (Calls{"ready", selectLine(0x00, 0x7F)}));
-
-  fake_ese::clearCalls();
-  fake_ese::queueTransceive({0, {}, 0x90, 0x00});
-  openBasic(se, kAid, 0x04);
-  EXPECT_EQ(fake_ese::calls(), (Calls{"ready", selectLine(0x00, 0x04)}));
-}
-
-// ---- SELECT replies, both channel kinds ----
-
-TEST_F(EseChannels, SelectStatusWordsAndTheCleanUpAfterAFailure) {
-  struct Row {
-    uint8_t sw1, sw2;
-    Status status;
+  // SELECT 61 xx: one GET RESPONSE with Le xx, whose whole reply is the select
+  // response; 6A 82 differs by channel kind, and 61 xx is not fetched again.
+  struct Get {
+    Bytes reply;
+    Status logical, basic;
   };
-  const std::vector<Row> rows = {
-      {0x90, 0x00, Status::SUCCESS},
-      {0x67, 0x00, Status::NO_SUCH_ELEMENT_ERROR},
-      {0x6A, 0x82, Status::NO_SUCH_ELEMENT_ERROR},
-      {0x6A, 0x86, Status::UNSUPPORTED_OPERATION},
-      {0x6A, 0x81, Status::FAILED},
-      {0x62, 0x83, Status::FAILED},
-      {0x90, 0x01, Status::FAILED},
-  };
-  for (const auto& row : rows) {
-    SCOPED_TRACE(hex2(row.sw1) + hex2(row.sw2));
-    const bool ok = row.status == Status::SUCCESS;
-    // Logical: a failed SELECT closes the channel, then powers off.
+  const std::vector<Get> gets = {
+      {{0x6F, 0x10, 0x90, 0x00}, Status::SUCCESS, Status::SUCCESS},
+      {{0x67, 0x00}, Status::NO_SUCH_ELEMENT_ERROR, Status::NO_SUCH_ELEMENT_ERROR},
+      {{0x6A, 0x86}, Status::UNSUPPORTED_OPERATION, Status::UNSUPPORTED_OPERATION},
+      {{0x6A, 0x82}, Status::FAILED, Status::NO_SUCH_ELEMENT_ERROR},
+      {{0x01, 0x61, 0x05}, Status::FAILED, Status::FAILED},
+      {{0x90}, Status::FAILED, Status::FAILED}};
+  for (const auto& g : gets) {
+    Calls logical{R, M, sel(1), getResponse(1, 0x10), CB}, basic{R, sel(0), getResponse(0, 0x2A), CB};
+    if (g.logical != Status::SUCCESS) logical.insert(logical.end(), {closeLine(1), P});
+    if (g.basic != Status::SUCCESS) basic.push_back(P);
+    rows.push_back({"get response " + fake_ese::hex(g.reply), 1, {{0, {1, 0x90, 0x00}}, {0, g.reply}},
+                    {{0, {}, 0x61, 0x10}, kOk}, g.reply, g.logical, logical});
+    rows.push_back({"basic get response " + fake_ese::hex(g.reply), kBasic, {{0, g.reply}},
+                    {{0, {}, 0x61, 0x2A}}, g.reply, g.basic, basic});
+  }
+  return rows;
+}
+
+class EseChannels : public EseFixture {};
+
+TEST_F(EseChannels, OpenDeliversOneResultThenClosesAndPowersOffAsNeeded) {
+  for (const OpenRow& row : openRows()) {
+    SCOPED_TRACE(row.name);
     fake_ese::reset();
     cap.clear();
-    fake_ese::queueIpc({0, {0x02, 0x90, 0x00}});
-    fake_ese::queueTransceive({0, {0xAB}, row.sw1, row.sw2});
-    fake_ese::queueTransceive({0, {}, 0x90, 0x00});  // the close, if one comes
-    LogicalResult r = openLogical(se, kAid, 0x00);
+    for (const auto& r : row.ipc) fake_ese::queueIpc(r);
+    for (const auto& r : row.trx) fake_ese::queueTransceive(r);
+    fake_ese::setReadyResult(row.readyRc);
+    setBufferAllocFailureForTest(row.allocFail);
+    const bool basic = row.channel == kBasic;
+    OpenResult r = basic ? openBasic(se, kAid, row.p2) : openLogical(se, kAid, row.p2);
+    setBufferAllocFailureForTest(0);
     EXPECT_EQ(r.calls, 1);
-    EXPECT_EQ(r.channel, 2);
+    EXPECT_EQ(r.channel, basic ? 0 : row.channel);
+    EXPECT_EQ(fake_ese::hex(r.select), fake_ese::hex(row.select));
     EXPECT_EQ(r.status, row.status);
-    EXPECT_EQ(r.select, (Bytes{0xAB, row.sw1, row.sw2}));
-    Calls expected{"ready", kManageOpen, selectLine(0x02, 0x00)};
-    if (!ok) expected.insert(expected.end(), {closeLine(2), kPowerOff});
-    EXPECT_EQ(fake_ese::calls(), expected);
-    EXPECT_EQ(logged(cap, "openLogicalChannel select return fail,try to close channel 2",
-                     ANDROID_LOG_DEBUG), !ok);
-    EXPECT_FALSE(logged(cap, "openLogicalChannel select return fail,close channel fail ",
-                        ANDROID_LOG_ERROR));
-
-    // Basic: a failed SELECT only powers off.
-    fake_ese::reset();
-    fake_ese::queueTransceive({0, {0xAB, 0xCD}, row.sw1, row.sw2});
-    BasicResult b = openBasic(se, kAid, 0x00);
-    EXPECT_EQ(b.calls, 1);
-    EXPECT_EQ(b.status, row.status);
-    EXPECT_EQ(b.select, (Bytes{0xAB, 0xCD, row.sw1, row.sw2}));
-    expected = {"ready", selectLine(0x00, 0x00)};
-    if (!ok) expected.push_back(kPowerOff);
-    EXPECT_EQ(fake_ese::calls(), expected);
+    EXPECT_EQ(fake_ese::calls(), row.calls);
+    EXPECT_TRUE(row.log.empty() || logged(cap, row.log, ANDROID_LOG_ERROR)) << row.log;
+    // A logical channel stays flagged unless the open closed it again.
+    const bool flagged = !basic && row.channel >= 1 && row.channel <= 3 &&
+                         std::count(row.calls.begin(), row.calls.end(), closeLine(row.channel)) == 0;
+    EXPECT_EQ(sweepFlags(se), flagged ? std::vector<uint8_t>{row.channel} : std::vector<uint8_t>{});
   }
+  EXPECT_TRUE(logged(cap, "openBasicChannel enter!", ANDROID_LOG_INFO));
 }
 
-TEST_F(EseChannels, FailedSelectExchangeOnLogicalChannelKeepsManageReplyAndCloses) {
-  fake_ese::queueIpc({0, {0x03, 0x90, 0x00}});
-  fake_ese::queueTransceive({-1, {}, 0x6A, 0x82});
-  fake_ese::queueTransceive({-1, {}, 0x00, 0x00});  // the close fails too
-  LogicalResult r = openLogical(se, kAid, 0x00);
-  EXPECT_EQ(r.channel, 3);
-  EXPECT_EQ(r.status, Status::FAILED);
-  EXPECT_EQ(r.select, (Bytes{0x03, 0x90, 0x00}));
-  EXPECT_EQ(fake_ese::calls(),
-            (Calls{"ready", kManageOpen, selectLine(0x03, 0x00), closeLine(3), kPowerOff}));
-  EXPECT_TRUE(logged(cap, "openLogicalChannel select return fail,close channel fail ",
-                     ANDROID_LOG_ERROR));
-  EXPECT_TRUE(flaggedChannels().empty());
-}
-
-TEST_F(EseChannels, FailedBasicSelectExchangeGivesMarker7EWithTheStatusWordLeft) {
-  struct Row {
-    uint8_t sw1, sw2;
-    Bytes expected;
-  };
-  const std::vector<Row> rows = {
-      {0x6A, 0x82, {0x7E, 0x6A, 0x82}},
-      {0x90, 0x00, {0x7E}},
-      {0x00, 0x00, {0x7E}},
-      {0x90, 0x01, {0x7E, 0x90, 0x01}},
-      {0x00, 0x01, {0x7E, 0x00, 0x01}},
-  };
-  for (const auto& row : rows) {
-    SCOPED_TRACE(hex2(row.sw1) + hex2(row.sw2));
-    fake_ese::reset();
-    fake_ese::queueTransceive({-1, {0x11, 0x22}, row.sw1, row.sw2});
-    BasicResult r = openBasic(se, kAid, 0x00);
-    EXPECT_EQ(r.calls, 1);
-    EXPECT_EQ(r.select, row.expected);
-    EXPECT_EQ(r.status, Status::FAILED);
-    EXPECT_EQ(fake_ese::calls(), (Calls{"ready", selectLine(0x00, 0x00), kPowerOff}));
-  }
-}
-
-// ---- GET RESPONSE after 61xx, fetched once on the channel of the SELECT ----
-
-TEST_F(EseChannels, Select61xxFetchesOnceWithGetResponse) {
-  struct Row {
-    const char* name;
-    fake_ese::IpcReply reply;
-    Status logical;
-    Status basic;
-  };
-  const std::vector<Row> rows = {
-      {"9000", {0, {0x6F, 0x10, 0x90, 0x00}}, Status::SUCCESS, Status::SUCCESS},
-      {"6700", {0, {0x67, 0x00}}, Status::NO_SUCH_ELEMENT_ERROR, Status::NO_SUCH_ELEMENT_ERROR},
-      {"6A86", {0, {0x6A, 0x86}}, Status::UNSUPPORTED_OPERATION, Status::UNSUPPORTED_OPERATION},
-      {"6A82", {0, {0x6A, 0x82}}, Status::FAILED, Status::NO_SUCH_ELEMENT_ERROR},
-      // More data pending is not fetched: there is no second GET RESPONSE.
-      {"6105", {0, {0x01, 0x02, 0x61, 0x05}}, Status::FAILED, Status::FAILED},
-      {"6F00", {0, {0x6F, 0x00}}, Status::FAILED, Status::FAILED},
-      {"one byte", {0, {0x90}}, Status::FAILED, Status::FAILED},
-      {"empty", {0, {}}, Status::FAILED, Status::FAILED},
-  };
-  for (const auto& row : rows) {
-    SCOPED_TRACE(row.name);
-    fake_ese::reset();
-    fake_ese::queueIpc({0, {0x01, 0x90, 0x00}});
-    fake_ese::queueTransceive({0, {}, 0x61, 0x10});
-    fake_ese::queueIpc(row.reply);
-    fake_ese::queueTransceive({0, {}, 0x90, 0x00});  // the close, if one comes
-    LogicalResult r = openLogical(se, kAid, 0x00);
-    EXPECT_EQ(r.calls, 1);
-    EXPECT_EQ(r.channel, 1);
-    EXPECT_EQ(r.status, row.logical);
-    EXPECT_EQ(r.select, row.reply.bytes);
-    Calls expected{"ready", kManageOpen, selectLine(0x01, 0x00), "ipc 01 C0 00 00 10"};
-    if (row.logical != Status::SUCCESS) expected.insert(expected.end(), {closeLine(1), kPowerOff});
-    EXPECT_EQ(fake_ese::calls(), expected);
-
-    fake_ese::reset();
-    fake_ese::queueTransceive({0, {}, 0x61, 0x2A});
-    fake_ese::queueIpc(row.reply);
-    BasicResult b = openBasic(se, kAid, 0x00);
-    EXPECT_EQ(b.calls, 1);
-    EXPECT_EQ(b.status, row.basic);
-    EXPECT_EQ(b.select, row.reply.bytes);
-    expected = {"ready", selectLine(0x00, 0x00), "ipc 00 C0 00 00 2A"};
-    if (row.basic != Status::SUCCESS) expected.push_back(kPowerOff);
-    EXPECT_EQ(fake_ese::calls(), expected);
-  }
-  EXPECT_TRUE(logged(cap, "openLogicalChannel enter! 0x61", ANDROID_LOG_INFO));
-  EXPECT_TRUE(logged(cap, "openLogicalChannel enter! 0x900", ANDROID_LOG_ERROR));
-  EXPECT_TRUE(logged(cap, "openBasicChannel enter! 0x61", ANDROID_LOG_INFO));
-  EXPECT_TRUE(logged(cap, "openBasicChannel enter! 0x6a82", ANDROID_LOG_INFO));
-}
-
-TEST_F(EseChannels, FailedGetResponseExchange) {
-  // Logical: the select response stays the SELECT reply.
-  fake_ese::queueIpc({0, {0x02, 0x90, 0x00}});
-  fake_ese::queueTransceive({0, {0x55}, 0x61, 0x08});
-  fake_ese::queueIpc({-1, {0x6A, 0x82}});
-  fake_ese::queueTransceive({0, {}, 0x90, 0x00});
-  LogicalResult l = openLogical(se, kAid, 0x00);
-  EXPECT_EQ(l.status, Status::FAILED);
-  EXPECT_EQ(l.select, (Bytes{0x55, 0x61, 0x08}));
-
-  // Basic: marker 7E, followed by the status word the library left, if any.
-  fake_ese::queueTransceive({0, {}, 0x61, 0x08});
-  fake_ese::queueIpc({-1, {0x01, 0x6A, 0x82}});
-  BasicResult b = openBasic(se, kAid, 0x00);
-  EXPECT_EQ(b.status, Status::FAILED);
-  EXPECT_EQ(b.select, (Bytes{0x7E, 0x6A, 0x82}));
-
-  fake_ese::queueTransceive({0, {}, 0x61, 0x08});
-  fake_ese::queueIpc({-1, {0x6A}});
-  b = openBasic(se, kAid, 0x00);
-  EXPECT_EQ(b.select, (Bytes{0x7E}));
-}
-
-// ---- closeChannel ----
-
-TEST_F(EseChannels, CloseChannel) {
+TEST_F(EseChannels, CloseChannelAlwaysPowersOff) {
   struct Row {
     const char* name;
     uint8_t channel;
-    std::vector<fake_ese::TransceiveReply> replies;
+    std::vector<Trx> replies;
     Status status;
     Calls calls;
+    unsigned allocFail = 0;
   };
   const std::vector<Row> rows = {
-      {"basic channel sends nothing", 0, {}, Status::FAILED, {kPowerOff}},
-      {"9000", 2, {{0, {}, 0x90, 0x00}}, Status::SUCCESS, {closeLine(2), kPowerOff}},
-      {"6881", 3, {{0, {}, 0x68, 0x81}}, Status::FAILED, {closeLine(3), kPowerOff}},
-      {"exchange fails", 1, {{-1, {}, 0x90, 0x00}}, Status::FAILED, {closeLine(1), kPowerOff}},
-      // Mended: a channel the table cannot hold is never indexed, and no
-      // close is built from it (its CLA would name another channel).
-      {"channel 4", 4, {}, Status::FAILED, {kPowerOff}},
-      {"channel 255", 255, {}, Status::FAILED, {kPowerOff}},
+      {"basic channel sends nothing", 0, {}, Status::FAILED, {P}},
+      {"9000", 2, {kOk}, Status::SUCCESS, {closeLine(2), P}},
+      {"6881", 3, {{0, {}, 0x68, 0x81}}, Status::FAILED, {closeLine(3), P}},
+      {"exchange fails", 1, {{-1, {}, 0x90, 0x00}}, Status::FAILED, {closeLine(1), P}},
+      // Mended: no close is built from a channel the table cannot hold.
+      {"channel 255", 255, {}, Status::FAILED, {P}},
+      {"alloc fails", 2, {kOk}, Status::FAILED, {P}, 1},
   };
   for (const auto& row : rows) {
     SCOPED_TRACE(row.name);
     fake_ese::reset();
     for (const auto& rep : row.replies) fake_ese::queueTransceive(rep);
+    setBufferAllocFailureForTest(row.allocFail);
     EXPECT_EQ(static_cast<Status>(se->closeChannel(row.channel)), row.status);
+    setBufferAllocFailureForTest(0);
     EXPECT_EQ(fake_ese::calls(), row.calls);
   }
-  EXPECT_TRUE(logged(cap, "closeChannel enter!", ANDROID_LOG_INFO));
-}
+  EXPECT_TRUE(logged(cap, "closeChannel rpdu.pdata malloc fail!", ANDROID_LOG_ERROR));
 
-TEST_F(EseChannels, CloseOneChannelLeavesTheOthersFlaggedAndStillPowersOff) {
+  // Closing one channel leaves the others flagged.
   scriptOpen(1);
-  ASSERT_EQ(openLogical(se, kAid, 0).status, Status::SUCCESS);
   scriptOpen(2);
   ASSERT_EQ(openLogical(se, kAid, 0).status, Status::SUCCESS);
-  fake_ese::clearCalls();
-  fake_ese::queueTransceive({0, {}, 0x90, 0x00});
+  ASSERT_EQ(openLogical(se, kAid, 0).status, Status::SUCCESS);
+  fake_ese::queueTransceive(kOk);
   EXPECT_EQ(static_cast<Status>(se->closeChannel(2)), Status::SUCCESS);
-  EXPECT_EQ(fake_ese::calls(), (Calls{closeLine(2), kPowerOff}));
-  EXPECT_EQ(flaggedChannels(), (std::vector<uint8_t>{1}));
-}
-
-// ---- Lengths the library hands back are bounded by the buffers ----
-
-TEST_F(EseChannels, ReportedLengthsNeverExceedTheBuffers) {
-  // Basic SELECT: 256-byte buffer, the library claims 300 data bytes.
-  Bytes full256(256, 0x5A);
-  fake_ese::queueTransceive({0, full256, 0x90, 0x00, 300});
-  BasicResult b = openBasic(se, kAid, 0x00);
-  ASSERT_EQ(b.select.size(), 258u);
-  EXPECT_EQ(Bytes(b.select.begin(), b.select.begin() + 256), full256);
-  EXPECT_EQ(b.status, Status::SUCCESS);
-
-  // Logical SELECT: 270-byte buffer, the library claims 65535.
-  fake_ese::queueIpc({0, {0x01, 0x90, 0x00}});
-  fake_ese::queueTransceive({0, Bytes(10, 0x11), 0x90, 0x00, 65535});
-  LogicalResult l = openLogical(se, kAid, 0x00);
-  EXPECT_EQ(l.select.size(), 272u);
-
-  // GET RESPONSE: 270-byte buffer, the library claims 100000.
-  Bytes full270(268, 0x22);
-  full270.push_back(0x90);
-  full270.push_back(0x00);
-  fake_ese::queueTransceive({0, {}, 0x61, 0x00});
-  fake_ese::queueIpc({0, full270, 100000});
-  b = openBasic(se, kAid, 0x00);
-  EXPECT_EQ(b.select, full270);
-  EXPECT_EQ(b.status, Status::SUCCESS);
-
-  // MANAGE CHANNEL open: the claimed length runs past the reply into zeros,
-  // which end the buffer; its last two bytes are no 90 00.
-  fake_ese::queueIpc({0, {0x01, 0x90, 0x00}, 4000});
-  l = openLogical(se, kAid, 0x00);
-  EXPECT_EQ(l.channel, 0xFF);
-  EXPECT_EQ(l.select.size(), 270u);
-}
-
-// ---- Mended: allocation failures still deliver one failure result ----
-
-TEST_F(EseChannels, LogicalOpenAllocationFailuresDeliverOneFailure) {
-  struct Row {
-    unsigned nth;  // which working buffer fails
-    const char* log;
-    uint8_t channel;
-    Calls calls;  // what reaches the library, the clean-up included
-  };
-  const std::vector<Row> rows = {
-      // Before MANAGE CHANNEL: the close of channel 0 only asks the power-off.
-      {1, "openLogicalChannel cmdApdu.p_data malloc fail!", 0, {kPowerOff}},
-      {2, "openLogicalChannel rspApdu.p_data malloc fail!", 0, {kPowerOff}},
-      // After channel 1 is assigned: it stays open and flagged, no power-off.
-      {3, "openLogicalChannel cpdu.pdata malloc fail!", 1, {"ready", kManageOpen}},
-      {4, "openLogicalChannel rpdu.pdata malloc fail!", 1, {"ready", kManageOpen}},
-      {5, "openLogicalChannel cmdApdu.p_data malloc fail!", 1,
-       {"ready", kManageOpen, selectLine(1, 0)}},
-      {6, "openLogicalChannel rspApdu.p_dataa malloc fail!", 1,
-       {"ready", kManageOpen, selectLine(1, 0)}},
-  };
-  for (const auto& row : rows) {
-    SCOPED_TRACE(row.nth);
-    fake_ese::reset();
-    cap.clear();
-    fake_ese::queueIpc({0, {0x01, 0x90, 0x00}});
-    fake_ese::queueTransceive({0, {}, 0x61, 0x04});
-    setBufferAllocFailureForTest(row.nth);
-    LogicalResult r = openLogical(se, kAid, 0x00);
-    setBufferAllocFailureForTest(0);
-    EXPECT_EQ(r.calls, 1);
-    EXPECT_EQ(r.status, Status::FAILED);
-    EXPECT_EQ(r.channel, row.channel);
-    EXPECT_EQ(fake_ese::calls(), row.calls);
-    EXPECT_TRUE(logged(cap, row.log, ANDROID_LOG_ERROR));
-    if (row.nth <= 2) {
-      EXPECT_TRUE(logged(cap, "openLogicalChannel select return fail,close channel fail ",
-                         ANDROID_LOG_ERROR));
-    } else {
-      EXPECT_EQ(flaggedChannels(), (std::vector<uint8_t>{1}));
-    }
-  }
-}
-
-TEST_F(EseChannels, BasicOpenAllocationFailuresDeliverOneFailureWithoutPowerOff) {
-  struct Row {
-    unsigned nth;
-    const char* log;
-    Calls calls;
-    Bytes select;
-  };
-  const std::vector<Row> rows = {
-      {1, "openBasicChannel cpdu.pdata malloc fail!", {}, {}},
-      {2, "openBasicChannel rpdu.pdata malloc fail!", {}, {}},
-      {3, "openBasicChannel cmdApdu.p_data malloc fail!", {"ready", selectLine(0, 0)}, {0x61, 0x04}},
-      {4, "openBasicChannel rspApdu.p_data malloc fail!", {"ready", selectLine(0, 0)}, {0x61, 0x04}},
-  };
-  for (const auto& row : rows) {
-    SCOPED_TRACE(row.nth);
-    fake_ese::reset();
-    cap.clear();
-    fake_ese::queueTransceive({0, {}, 0x61, 0x04});
-    setBufferAllocFailureForTest(row.nth);
-    BasicResult r = openBasic(se, kAid, 0x00);
-    setBufferAllocFailureForTest(0);
-    EXPECT_EQ(r.calls, 1);
-    EXPECT_EQ(r.status, Status::FAILED);
-    EXPECT_EQ(r.select, row.select);
-    EXPECT_EQ(fake_ese::calls(), row.calls);
-    EXPECT_TRUE(logged(cap, row.log, ANDROID_LOG_ERROR));
-  }
-}
-
-TEST_F(EseChannels, CloseAllocationFailureIsAFailedClose) {
-  setBufferAllocFailureForTest(1);
-  EXPECT_EQ(static_cast<Status>(se->closeChannel(2)), Status::FAILED);
-  EXPECT_EQ(fake_ese::calls(), (Calls{kPowerOff}));
-  EXPECT_TRUE(logged(cap, "closeChannel rpdu.pdata malloc fail!", ANDROID_LOG_ERROR));
+  EXPECT_EQ(sweepFlags(se), (std::vector<uint8_t>{1}));
 }
 
 }  // namespace

@@ -2,7 +2,12 @@
 // vendor library, and the rules of its one lock.
 #include <gtest/gtest.h>
 
+#include <sys/syscall.h>
+#include <unistd.h>
+
 #include <chrono>
+#include <fstream>
+#include <functional>
 #include <future>
 #include <thread>
 
@@ -14,94 +19,66 @@ using namespace ese_test;
 
 namespace {
 
-constexpr int kGenerousMs = 5000;
-// How long a call that must stay behind the lock is given to show up anyway.
-constexpr int kMustNotArriveMs = 300;
+using ::android::hidl::base::V1_0::IBase;
 
 class EseLifecycle : public EseFixture {
  protected:
   sp<FakeClient> client = new FakeClient();
 };
 
-// ---- init ----
-
-TEST_F(EseLifecycle, InitWithoutCallbackDoesNothing) {
+TEST_F(EseLifecycle, InitOpensTheEseAndReportsOnlyASuccessfulOpen) {
   se->init(nullptr);
   EXPECT_TRUE(fake_ese::calls().empty());
-  EXPECT_TRUE(logged(cap, "init enter!", ANDROID_LOG_INFO));
   EXPECT_TRUE(logged(cap, "clientCallback IS NULL", ANDROID_LOG_ERROR));
-}
 
-TEST_F(EseLifecycle, InitLinksToDeathOpensTheEseAndReportsConnected) {
   se->init(client);
-  EXPECT_EQ(fake_ese::calls(), (Calls{"status", "open"}));
-  EXPECT_EQ(client->connected.load(), 1);
-  EXPECT_EQ(client->disconnected.load(), 0);
-  ASSERT_EQ(client->linkCookies.size(), 1u);
-  EXPECT_EQ(client->linkCookies[0], 0u);
-  EXPECT_EQ(client->linkRecipients[0].get(),
-            static_cast<::android::hardware::hidl_death_recipient*>(se.get()));
-
-  // A second init opens again, even though the eSE is already open.
-  fake_ese::clearCalls();
-  se->init(client);
-  EXPECT_EQ(fake_ese::calls(), (Calls{"status", "open"}));
+  se->init(client);  // opens again although already open
+  EXPECT_EQ(fake_ese::calls(), (Calls{"status", "open", "status", "open"}));
   EXPECT_EQ(client->connected.load(), 2);
-}
+  EXPECT_EQ(client->linkCookies, (std::vector<uint64_t>{0, 0}));
+  EXPECT_EQ(client->linkRecipients[0].get(), static_cast<hidl_death_recipient*>(se.get()));
 
-TEST_F(EseLifecycle, InitOpenFailureTellsTheClientNothing) {
   fake_ese::setInitOpenResult(-1);
   se->init(client);
-  EXPECT_EQ(client->connected.load() + client->disconnected.load(), 0);
+  EXPECT_EQ(client->connected.load(), 2);
+  EXPECT_EQ(client->disconnected.load(), 0);
+  EXPECT_TRUE(logged(cap, "init enter!", ANDROID_LOG_INFO));
   EXPECT_TRUE(logged(cap, "phQvEse_init_open FAIL", ANDROID_LOG_ERROR));
 }
 
 TEST_F(EseLifecycle, InitSweepsFlaggedChannelsOneToThreeWhenReady) {
-  scriptOpen(1);
-  ASSERT_EQ(openLogical(se, kAid, 0).status, Status::SUCCESS);
-  scriptOpen(3);
-  ASSERT_EQ(openLogical(se, kAid, 0).status, Status::SUCCESS);
-
-  // Not ready: nothing is closed and the flags stay.
+  // Channel 0 flagged too: a card may hand it out, but it is never swept.
+  for (uint8_t c : {0, 1, 3}) {
+    scriptOpen(c);
+    ASSERT_EQ(openLogical(se, kAid, 0).status, Status::SUCCESS);
+  }
   fake_ese::clearCalls();
-  fake_ese::setReadyStatus(1);
+  fake_ese::setReadyStatus(1);  // not ready: nothing closed
   se->init(client);
   EXPECT_EQ(fake_ese::calls(), (Calls{"status", "open"}));
 
-  // Ready: 1 then 3, each closed and powered off, then the open.
   fake_ese::clearCalls();
   fake_ese::setReadyStatus(0);
   fake_ese::queueTransceive({0, {}, 0x90, 0x00});
   fake_ese::queueTransceive({-1, {}, 0x00, 0x00});  // a failed close is ignored
   se->init(client);
-  EXPECT_EQ(fake_ese::calls(), (Calls{"status", closeLine(1), kPowerOff, closeLine(3), kPowerOff,
-                                      "open"}));
-  EXPECT_EQ(client->connected.load(), 2);
+  EXPECT_EQ(fake_ese::calls(),
+            (Calls{"status", closeLine(1), kPowerOff, closeLine(3), kPowerOff, "open"}));
   EXPECT_TRUE(logged(cap, "internalCloseChannel enter!", ANDROID_LOG_INFO));
-
-  // The flags were cleared by the sweep, the failed close's included.
-  fake_ese::clearCalls();
-  se->init(client);
-  EXPECT_EQ(fake_ese::calls(), (Calls{"status", "open"}));
+  EXPECT_TRUE(sweepFlags(se).empty());  // the failed close's flag cleared too
 }
 
 TEST_F(EseLifecycle, ServiceDiedClosesTheEseAndKeepsTheFlags) {
   scriptOpen(2);
   ASSERT_EQ(openLogical(se, kAid, 0).status, Status::SUCCESS);
   fake_ese::clearCalls();
-  se->serviceDied(0, ::android::wp<::android::hidl::base::V1_0::IBase>());
+  se->serviceDied(0, ::android::wp<IBase>());
   EXPECT_EQ(fake_ese::calls(), (Calls{"close"}));
   EXPECT_TRUE(logged(cap, "serviceDied enter!", ANDROID_LOG_ERROR));
-
-  fake_ese::clearCalls();
-  fake_ese::queueTransceive({0, {}, 0x90, 0x00});
-  se->init(client);
-  EXPECT_EQ(fake_ese::calls(), (Calls{"status", closeLine(2), kPowerOff, "open"}));
-  EXPECT_EQ(client->connected.load(), 1);
+  EXPECT_EQ(sweepFlags(se), (std::vector<uint8_t>{2}));
 }
 
 TEST_F(EseLifecycle, CardPresentAndEmptyAtrWithoutAskingTheLibrary) {
-  fake_ese::setReadyResult(-1);
   EXPECT_TRUE(static_cast<bool>(se->isCardPresent()));
   int atrCalls = 0;
   Bytes atr{0x01};
@@ -112,43 +89,29 @@ TEST_F(EseLifecycle, CardPresentAndEmptyAtrWithoutAskingTheLibrary) {
   EXPECT_EQ(atrCalls, 1);
   EXPECT_TRUE(atr.empty());
   EXPECT_TRUE(fake_ese::calls().empty());
-  EXPECT_TRUE(logged(cap, "isCardPresent enter!", ANDROID_LOG_INFO));
   EXPECT_TRUE(logged(cap, "getAtr enter!", ANDROID_LOG_INFO));
 }
 
-// ---- transmit ----
-
 TEST_F(EseLifecycle, TransmitRewritesOnlyCaseOneAndGetResponseCommands) {
-  struct Row {
-    Bytes in;
-    const char* sent;
-  };
-  const std::vector<Row> rows = {
+  const std::vector<std::pair<Bytes, const char*>> rows = {
       // Mended: a 4-byte command gets Le 00 appended; its P2 stays P2.
       {{0x00, 0xA4, 0x04, 0x0C}, "ipc 00 A4 04 0C 00"},
-      {{0x80, 0xCA, 0x9F, 0x7F}, "ipc 80 CA 9F 7F 00"},
-      // A 4-byte GET RESPONSE keeps its CLA.
-      {{0x80, 0xC0, 0x00, 0x00}, "ipc 80 C0 00 00 00"},
+      {{0x80, 0xC0, 0x00, 0x00}, "ipc 80 C0 00 00 00"},  // CLA kept
       // A 5-byte GET RESPONSE keeps only the channel bits of CLA.
-      {{0x81, 0xC0, 0x00, 0x00, 0x20}, "ipc 01 C0 00 00 20"},
       {{0xFF, 0xC0, 0x00, 0x00, 0x10}, "ipc 03 C0 00 00 10"},
       {{0x84, 0xB0, 0x00, 0x00, 0x10}, "ipc 84 B0 00 00 10"},
-      {{0x01, 0xD6, 0x00, 0x00, 0x01, 0x55}, "ipc 01 D6 00 00 01 55"},
       {{0x81, 0xC0, 0x00, 0x00, 0x01, 0x20}, "ipc 81 C0 00 00 01 20"},
       {{0x00, 0xA4, 0x04}, "ipc 00 A4 04"},
       {{}, "ipc "},
   };
   for (const auto& row : rows) {
-    SCOPED_TRACE(row.sent);
+    SCOPED_TRACE(row.second);
     fake_ese::reset();
     fake_ese::queueIpc({0, {0x90, 0x00}});
-    auto r = transmit(se, row.in);
-    EXPECT_EQ(r.first, 1);
-    EXPECT_EQ(r.second, (Bytes{0x90, 0x00}));
-    // No READY, no power-off, nothing but the one exchange.
-    EXPECT_EQ(fake_ese::calls(), (Calls{row.sent}));
+    // Nothing but the one exchange: no READY, no power-off.
+    EXPECT_EQ(transmit(se, row.first), std::make_pair(1, Bytes{0x90, 0x00}));
+    EXPECT_EQ(fake_ese::calls(), (Calls{row.second, "result"}));
   }
-  EXPECT_TRUE(logged(cap, "transmit enter!", ANDROID_LOG_INFO));
 }
 
 TEST_F(EseLifecycle, TransmitResponses) {
@@ -156,137 +119,127 @@ TEST_F(EseLifecycle, TransmitResponses) {
     const char* name;
     fake_ese::IpcReply reply;
     Bytes response;
-    bool failedLog;
+    const char* log;  // at error level
+    unsigned allocFail = 0;
   };
   const std::vector<Row> rows = {
-      {"ok 9000", {0, {0x90, 0x00}}, {0x90, 0x00}, false},
-      {"ok 61xx passed as is", {0, {0x01, 0x61, 0x10}}, {0x01, 0x61, 0x10}, false},
-      {"ok empty", {0, {}}, {}, false},
-      {"ok one byte", {0, {0x6F}}, {0x6F}, false},
-      {"failed, nothing back", {-1, {}}, {0x1F}, true},
-      {"failed, one byte back", {-1, {0x6F}}, {0x1F}, true},
-      {"failed, 6F00 back", {-1, {0x6F, 0x00}}, {0x6F, 0x00}, true},
-      {"claims more than the buffer", {0, Bytes(270, 0x33), 5000}, Bytes(270, 0x33), false},
+      {"ok 61xx passed as is", {0, {0x01, 0x61, 0x10}}, {0x01, 0x61, 0x10}, nullptr},
+      {"ok empty", {0, {}}, {}, nullptr},
+      {"failed, one byte back", {-1, {0x6F}}, {0x1F}, "transmit failed!!!"},
+      {"failed, 6F00 back", {-1, {0x6F, 0x00}}, {0x6F, 0x00}, "transmit failed!!!"},
+      {"claims more than the buffer", {0, Bytes(270, 0x33), 5000}, Bytes(270, 0x33), nullptr},
+      // Mended: a failed allocation still answers, with 1F.
+      {"command alloc fails", {}, {0x1F}, "transmit cmdApdu.p_data malloc fail!", 1},
+      {"response alloc fails", {}, {0x1F}, "transmit rspApdu.p_data malloc fail!", 2},
   };
   for (const auto& row : rows) {
     SCOPED_TRACE(row.name);
     fake_ese::reset();
     cap.clear();
     fake_ese::queueIpc(row.reply);
-    auto r = transmit(se, {0x00, 0xB0, 0x00, 0x00, 0x02});
-    EXPECT_EQ(r.first, 1);
-    EXPECT_EQ(r.second, row.response);
-    EXPECT_EQ(logged(cap, "transmit failed!!!", ANDROID_LOG_ERROR), row.failedLog);
-  }
-}
-
-TEST_F(EseLifecycle, TransmitAllocationFailuresStillAnswer1F) {
-  const std::vector<std::pair<unsigned, const char*>> rows = {
-      {1, "transmit cmdApdu.p_data malloc fail!"},
-      {2, "transmit rspApdu.p_data malloc fail!"},
-  };
-  for (const auto& row : rows) {
-    SCOPED_TRACE(row.first);
-    fake_ese::reset();
-    setBufferAllocFailureForTest(row.first);
-    auto r = transmit(se, {0x00, 0xB0, 0x00, 0x00, 0x02});
+    setBufferAllocFailureForTest(row.allocFail);
+    EXPECT_EQ(transmit(se, {0x00, 0xB0, 0x00, 0x00, 0x02}), std::make_pair(1, row.response));
     setBufferAllocFailureForTest(0);
-    EXPECT_EQ(r.first, 1);
-    EXPECT_EQ(r.second, (Bytes{0x1F}));
-    EXPECT_TRUE(fake_ese::calls().empty());
-    EXPECT_TRUE(logged(cap, row.second, ANDROID_LOG_ERROR));
+    EXPECT_TRUE(!row.log || logged(cap, row.log, ANDROID_LOG_ERROR));
+    EXPECT_EQ(logged(cap, "transmit failed!!!", ANDROID_LOG_ERROR), row.reply.rc != 0);
   }
 }
 
 // ---- The lock ----
 
-// Runs `op` on its own thread; the future is ready when it returns.
-std::future<void> runAsync(std::function<void()> op) {
-  return std::async(std::launch::async, std::move(op));
-}
+constexpr auto kGenerous = std::chrono::seconds(10);
 
-bool finishes(std::future<void>& f, int ms) {
-  return f.wait_for(std::chrono::milliseconds(ms)) == std::future_status::ready;
-}
+// Runs `op` on a thread of its own and comes back once the thread has either
+// finished or gone to sleep. Holding the lock, the test sees the thread asleep
+// when it waits for that lock: the fake library, the only other place it could
+// wait, is not reached while the lock is held.
+class Contender {
+ public:
+  explicit Contender(std::function<void()> op)
+      : done_(std::async(std::launch::async, [this, op] {
+          tid_.store(static_cast<pid_t>(syscall(SYS_gettid)));
+          op();
+        })) {
+    while (done_.wait_for(std::chrono::seconds(0)) != std::future_status::ready && !asleep())
+      std::this_thread::yield();
+  }
+  bool finishes() { return done_.wait_for(kGenerous) == std::future_status::ready; }
 
-TEST_F(EseLifecycle, ChannelOperationsWaitForARunningTransmit) {
-  struct Row {
-    const char* name;
-    std::function<void(const sp<SecureElement>&)> op;
-    std::string firstCall;  // the operation's first library call
-  };
-  const std::vector<Row> rows = {
-      {"openLogicalChannel", [](const sp<SecureElement>& s) { openLogical(s, kAid, 0); }, "ready"},
-      {"openBasicChannel", [](const sp<SecureElement>& s) { openBasic(s, kAid, 0); }, "ready"},
-      {"closeChannel", [](const sp<SecureElement>& s) { s->closeChannel(1); }, closeLine(1)},
-      {"transmit", [](const sp<SecureElement>& s) { transmit(s, {0x00, 0xB0, 0x00, 0x00, 0x01}); },
-       "ipc 00 B0 00 00 01"},
-  };
-  for (const auto& row : rows) {
-    SCOPED_TRACE(row.name);
-    const std::string& first = row.firstCall;
-    fake_ese::reset();
+ private:
+  bool asleep() {
+    const pid_t tid = tid_.load();
+    if (tid == 0) return false;
+    std::ifstream stat("/proc/self/task/" + std::to_string(tid) + "/stat");
+    std::string line;
+    std::getline(stat, line);
+    const auto close = line.rfind(')');
+    return close != std::string::npos && close + 2 < line.size() && line[close + 2] == 'S';
+  }
+  std::atomic<pid_t> tid_{0};
+  std::future<void> done_;
+};
+
+// Holds the eSE lock: a transmit whose exchange waits until release().
+class LockHolder {
+ public:
+  explicit LockHolder(const sp<SecureElement>& se) {
     fake_ese::blockNextIpc();
     fake_ese::queueIpc({0, {0x90, 0x00}});
-    auto holder = runAsync([&] { transmit(se, {0x00, 0xCA, 0x00, 0x00, 0x00}); });
-    ASSERT_TRUE(fake_ese::waitIpcBlocked(kGenerousMs));
-
-    auto second = runAsync([&] { row.op(se); });
-    // While the transmit is inside the library, the other operation must not
-    // reach it.
-    EXPECT_FALSE(fake_ese::waitForCall(first, kMustNotArriveMs));
-    EXPECT_FALSE(finishes(second, 0));
+    done_ = std::async(std::launch::async, [se] { transmit(se, {0x00, 0xCA, 0x00, 0x00, 0x00}); });
+    EXPECT_TRUE(fake_ese::waitIpcBlocked(10000));
+  }
+  ~LockHolder() { release(); }
+  void release() {
     fake_ese::releaseBlockedIpc();
-    ASSERT_TRUE(finishes(holder, kGenerousMs));
-    ASSERT_TRUE(finishes(second, kGenerousMs));
-    EXPECT_TRUE(fake_ese::waitForCall(first, 0));
+    done_.wait();
+  }
+
+ private:
+  std::future<void> done_;
+};
+
+const char* kHeld = "ipc 00 CA 00 00 00";
+
+TEST_F(EseLifecycle, ChannelOperationsAndTransmitWaitForTheLock) {
+  const std::vector<std::pair<std::string, std::function<void()>>> rows = {
+      {"ready", [&] { openLogical(se, kAid, 0); }},
+      {"ready", [&] { openBasic(se, kAid, 0); }},
+      {closeLine(1), [&] { se->closeChannel(1); }},
+      {"ipc 00 B0 00 00 01", [&] { transmit(se, {0x00, 0xB0, 0x00, 0x00, 0x01}); }},
+  };
+  for (const auto& row : rows) {
+    SCOPED_TRACE(row.first);
+    fake_ese::reset();
+    LockHolder holder(se);
+    Contender contender(row.second);
+    holder.release();
+    ASSERT_TRUE(contender.finishes());
+    // The holder's exchange and result came first, the contender's call after.
+    const Calls calls = fake_ese::calls();
+    ASSERT_GE(calls.size(), 3u);
+    EXPECT_EQ(Calls(calls.begin(), calls.begin() + 3), (Calls{kHeld, "result", row.first}));
   }
 }
 
-TEST_F(EseLifecycle, TransmitWaitsForARunningChannelOpen) {
-  fake_ese::blockNextIpc();  // the MANAGE CHANNEL open
-  fake_ese::queueIpc({0, {0x01, 0x90, 0x00}});
-  fake_ese::queueTransceive({0, {}, 0x90, 0x00});
-  auto holder = runAsync([&] { openLogical(se, kAid, 0); });
-  ASSERT_TRUE(fake_ese::waitIpcBlocked(kGenerousMs));
-
-  auto second = runAsync([&] { transmit(se, {0x01, 0xB0, 0x00, 0x00, 0x01}); });
-  EXPECT_FALSE(fake_ese::waitForCall("ipc 01 B0 00 00 01", kMustNotArriveMs));
-  fake_ese::releaseBlockedIpc();
-  ASSERT_TRUE(finishes(holder, kGenerousMs));
-  ASSERT_TRUE(finishes(second, kGenerousMs));
-  // The open ran to its end before the transmit began.
-  EXPECT_EQ(fake_ese::calls(),
-            (Calls{"ready", kManageOpen, selectLine(1, 0), "ipc 01 B0 00 00 01"}));
-}
-
-TEST_F(EseLifecycle, InitAndServiceDiedDoNotWaitForTheLock) {
+TEST_F(EseLifecycle, OtherOperationsDoNotWaitForTheLock) {
   // Channel 2 flagged, so that init's sweep closes it while the lock is held.
   scriptOpen(2);
   ASSERT_EQ(openLogical(se, kAid, 0).status, Status::SUCCESS);
-
-  fake_ese::clearCalls();
-  fake_ese::blockNextIpc();
-  fake_ese::queueIpc({0, {0x90, 0x00}});
-  auto holder = runAsync([&] { transmit(se, {0x00, 0xCA, 0x00, 0x00, 0x00}); });
-  ASSERT_TRUE(fake_ese::waitIpcBlocked(kGenerousMs));
-
+  fake_ese::reset();
   fake_ese::queueTransceive({0, {}, 0x90, 0x00});
-  auto initCall = runAsync([&] { se->init(client); });
-  const bool initDone = finishes(initCall, kGenerousMs);
-  auto diedCall = runAsync([&] { se->serviceDied(0, ::android::wp<::android::hidl::base::V1_0::IBase>()); });
-  const bool diedDone = finishes(diedCall, kGenerousMs);
-  auto presentCall = runAsync([&] { se->isCardPresent(); });
-  const bool presentDone = finishes(presentCall, kGenerousMs);
-
-  fake_ese::releaseBlockedIpc();  // before asserting, so nothing is left waiting
-  EXPECT_TRUE(initDone);
-  EXPECT_TRUE(diedDone);
-  EXPECT_TRUE(presentDone);
-  ASSERT_TRUE(finishes(holder, kGenerousMs));
+  LockHolder holder(se);
+  Contender init([&] { se->init(client); });
+  EXPECT_TRUE(init.finishes());
+  Contender died([&] { se->serviceDied(0, ::android::wp<IBase>()); });
+  EXPECT_TRUE(died.finishes());
+  Contender present([&] { se->isCardPresent(); });
+  EXPECT_TRUE(present.finishes());
+  Contender atr([&] { se->getAtr([](const hidl_vec<uint8_t>&) { fake_ese::note("atr"); }); });
+  EXPECT_TRUE(atr.finishes());
+  holder.release();
   EXPECT_EQ(client->connected.load(), 1);
-  EXPECT_EQ(fake_ese::calls(), (Calls{"ipc 00 CA 00 00 00", "status", closeLine(2), kPowerOff,
-                                      "open", "close"}));
+  EXPECT_EQ(fake_ese::calls(),
+            (Calls{kHeld, "status", closeLine(2), kPowerOff, "open", "close", "atr", "result"}));
 }
 
 }  // namespace

@@ -1,10 +1,10 @@
 #pragma once
 // Shared pieces of the eSE front tests: a recording client callback, helpers
-// that run one operation and hand back what its result callback got.
+// that run one operation and keep what its result callback got (noting
+// "result" in the fake library's call log when it runs), call log lines.
 #include <atomic>
-#include <cstdio>
 #include <cstdint>
-#include <mutex>
+#include <cstdio>
 #include <string>
 #include <vector>
 
@@ -25,16 +25,17 @@ using ::android::hardware::secure_element::V1_0::ISecureElementHalCallback;
 using ::android::hardware::secure_element::V1_0::LogicalChannelResponse;
 using ::android::hardware::secure_element::V1_0::SecureElementStatus;
 using ::android::hardware::secure_element::V1_0::implementation::SecureElement;
-
-using ::android::hardware::secure_element::V1_0::implementation::setBufferAllocFailureForTest;
 using Bytes = std::vector<uint8_t>;
 using Calls = std::vector<std::string>;
 using Status = SecureElementStatus;
 
+// The nth working-buffer allocation of the front from now on fails (1 = the
+// next one); 0 turns it off. Defined by the test allocator (failing_alloc.cpp).
+void setBufferAllocFailureForTest(unsigned nth);
+
 struct FakeClient : public ISecureElementHalCallback {
   std::atomic<int> connected{0};
   std::atomic<int> disconnected{0};
-  std::mutex mu;
   std::vector<uint64_t> linkCookies;
   std::vector<sp<hidl_death_recipient>> linkRecipients;
 
@@ -43,55 +44,44 @@ struct FakeClient : public ISecureElementHalCallback {
     return ::android::hardware::Void();
   }
   Return<bool> linkToDeath(const sp<hidl_death_recipient>& recipient, uint64_t cookie) override {
-    std::lock_guard<std::mutex> l(mu);
     linkCookies.push_back(cookie);
     linkRecipients.push_back(recipient);
     return true;
   }
 };
 
-struct LogicalResult {
+// What one open delivered; `calls` counts the result callbacks.
+struct OpenResult {
   int calls = 0;
   uint8_t channel = 0;
   Bytes select;
-  SecureElementStatus status = SecureElementStatus::SUCCESS;
+  Status status = Status::SUCCESS;
 };
 
-struct BasicResult {
-  int calls = 0;
-  Bytes select;
-  SecureElementStatus status = SecureElementStatus::SUCCESS;
-};
-
-inline LogicalResult openLogical(const sp<SecureElement>& se, const Bytes& aid, uint8_t p2) {
-  LogicalResult r;
-  se->openLogicalChannel(hidl_vec<uint8_t>(aid), p2,
-                         [&](const LogicalChannelResponse& resp, SecureElementStatus st) {
-                           ++r.calls;
-                           r.channel = resp.channelNumber;
-                           r.select = resp.selectResponse;
-                           r.status = st;
-                         });
+inline OpenResult openLogical(const sp<SecureElement>& se, const Bytes& aid, uint8_t p2) {
+  OpenResult r;
+  se->openLogicalChannel(aid, p2, [&](const LogicalChannelResponse& resp, Status st) {
+    fake_ese::note("result");
+    r = {r.calls + 1, resp.channelNumber, resp.selectResponse, st};
+  });
   return r;
 }
 
-inline BasicResult openBasic(const sp<SecureElement>& se, const Bytes& aid, uint8_t p2) {
-  BasicResult r;
-  se->openBasicChannel(hidl_vec<uint8_t>(aid), p2,
-                       [&](const hidl_vec<uint8_t>& resp, SecureElementStatus st) {
-                         ++r.calls;
-                         r.select = resp;
-                         r.status = st;
-                       });
+inline OpenResult openBasic(const sp<SecureElement>& se, const Bytes& aid, uint8_t p2) {
+  OpenResult r;
+  se->openBasicChannel(aid, p2, [&](const hidl_vec<uint8_t>& resp, Status st) {
+    fake_ese::note("result");
+    r = {r.calls + 1, 0, resp, st};
+  });
   return r;
 }
 
 // The response and how many times the callback ran.
 inline std::pair<int, Bytes> transmit(const sp<SecureElement>& se, const Bytes& apdu) {
   std::pair<int, Bytes> r{0, {}};
-  se->transmit(hidl_vec<uint8_t>(apdu), [&](const hidl_vec<uint8_t>& resp) {
-    ++r.first;
-    r.second = resp;
+  se->transmit(apdu, [&](const hidl_vec<uint8_t>& resp) {
+    fake_ese::note("result");
+    r = {r.first + 1, resp};
   });
   return r;
 }
@@ -108,7 +98,6 @@ inline bool logged(const ::android::host::LogCapture& cap, const std::string& te
 }
 
 const Bytes kAid = {0xA0, 0x00, 0x00, 0x01, 0x51};
-
 constexpr const char* kManageOpen = "ipc 00 70 00 00 01";
 constexpr const char* kPowerOff = "power korva_poweroff";
 
@@ -120,8 +109,8 @@ inline std::string hex2(uint8_t b) {
 
 // The call log line of a SELECT by DF name for kAid.
 inline std::string selectLine(uint8_t cla, uint8_t p2) {
-  return "trx " + hex2(cla) + " A4 04 " + hex2(p2) + " lc=" + std::to_string(kAid.size()) + " " +
-         fake_ese::hex(kAid) + " le_type=1 le=256 rlen=2";
+  return "trx " + hex2(cla) + " A4 04 " + hex2(p2) + " lc=5 " + fake_ese::hex(kAid) +
+         " le_type=1 le=256 rlen=2";
 }
 
 // The call log line of MANAGE CHANNEL close for channel c.
@@ -142,29 +131,27 @@ inline void scriptOpen(uint8_t c) {
 inline std::vector<uint8_t> sweepFlags(const sp<SecureElement>& se) {
   fake_ese::reset();
   for (int i = 0; i < 3; ++i) fake_ese::queueTransceive({0, {}, 0x90, 0x00});
-  sp<FakeClient> sweeper = new FakeClient();
-  se->init(sweeper);
+  se->init(new FakeClient());
   std::vector<uint8_t> closed;
-  for (const auto& line : fake_ese::calls()) {
+  for (const auto& line : fake_ese::calls())
     for (uint8_t c = 1; c <= 3; ++c)
       if (line == closeLine(c)) closed.push_back(c);
-  }
   fake_ese::reset();
   return closed;
 }
 
-// A fresh front over a reset library, with no channel left flagged.
+// A fresh front over a reset library. The channel table is process-wide, so
+// every entry is cleared first, through the front's own close.
 class EseFixture : public ::testing::Test {
  protected:
   void SetUp() override {
+    setBufferAllocFailureForTest(0);
+    for (uint8_t c = 0; c < 4; ++c) se->closeChannel(c);
     fake_ese::reset();
-    ::android::hardware::secure_element::V1_0::implementation::setBufferAllocFailureForTest(0);
-    se = new SecureElement();
-    sweepFlags(se);
     cap.clear();
   }
   ::android::host::LogCapture cap;
-  sp<SecureElement> se;
+  sp<SecureElement> se = new SecureElement();
 };
 
 }  // namespace ese_test
