@@ -10,6 +10,10 @@
 #                            sanitizer (build/). The plain pass comes last, so
 #                            the output ends with its ctest summary.
 #
+# Besides ctest (one process per test), every pass also runs each test binary
+# whole, once, in shuffled order (whole_runs below), which shows state that
+# leaks from one test to the next.
+#
 # Environment: BUILD_DIR (plain pass folder), ASAN_DIR, TSAN_DIR, FUZZ_DIR
 # (the other passes' folders), SE_SANITIZE (plain mode only: build that one
 # pass with a sanitizer), FUZZ_SECONDS (per target, default 30), JOBS
@@ -21,13 +25,37 @@ all=0
 if [ "${1:-}" = "--all" ] || [ "${CI:-}" = "true" ]; then all=1; fi
 jobs=${JOBS:-$(nproc)}
 
+# Runs every test binary of build folder $1 whole and shuffled, $jobs at a
+# time, under the wrapper given after it; one line per binary, the failed
+# tests of those that fail, their output in $1/whole-runs/. Fails if any fails.
+whole_runs() {
+  local dir=$1
+  shift
+  mkdir -p "$dir/whole-runs"
+  local bins=("$dir"/bin/*_test)
+  [ -e "${bins[0]}" ] || { echo "no test binaries in $dir/bin"; return 1; }
+  printf '%s\n' "${bins[@]}" | xargs -P "$jobs" -I{} sh -c '
+    b=$1; shift; log="$0/whole-runs/$(basename "$b").log"
+    if "$@" timeout 900 "$b" --gtest_shuffle >"$log" 2>&1; then
+      printf "whole %-28s ok\n" "$(basename "$b")"
+    else
+      printf "whole %-28s FAIL (%s)\n" "$(basename "$b")" "$log"
+      grep -E "^\[  FAILED  \] .*\(" "$log" | head -10 | sed "s/^/    /"
+      grep -E "seed of|AddressSanitizer|ThreadSanitizer|terminate|Segmentation" "$log" | head -3 | sed "s/^/    /"
+      exit 1
+    fi' "$dir" {} "$@"
+}
+
 if [ $all -eq 0 ]; then
   scripts/deps.sh
   build=${BUILD_DIR:-build}
   cmake -S . -B "$build" -DSE_SANITIZE="${SE_SANITIZE:-}" >/dev/null
   cmake --build "$build" -j"$jobs"
-  ctest --test-dir "$build" --output-on-failure -j"$jobs" --timeout 300
-  exit
+  status=0
+  whole_runs "$build" || status=1
+  ctest --test-dir "$build" --output-on-failure -j"$jobs" --timeout 300 || status=1
+  [ $status -eq 0 ] || echo "=== failed: see the FAIL lines above and the ctest summary"
+  exit $status
 fi
 
 scripts/deps.sh fuzz
@@ -59,6 +87,8 @@ pass() {  # name, build dir, sanitizer, [wrapper...]
     failed+=("$name-build")
     return
   fi
+  stamp "$name: each test binary whole, shuffled"
+  whole_runs "$dir" "$@" || failed+=("$name-whole")
   stamp "$name: tests"
   "$@" ctest --test-dir "$dir" --output-on-failure -j"$jobs" --timeout 300 || failed+=("$name")
 }
@@ -67,5 +97,5 @@ pass address "${ASAN_DIR:-build-asan}" address
 pass thread "${TSAN_DIR:-build-tsan}" thread "${tsan_wrap[@]}"
 if [ ${#failed[@]} -ne 0 ]; then echo "=== failed so far: ${failed[*]}"; fi
 pass plain "${BUILD_DIR:-build}" ""
-# Nothing is printed after the last ctest summary; the status tells the rest.
-[ ${#failed[@]} -eq 0 ]
+# Nothing but the list of failed steps follows the last ctest summary.
+if [ ${#failed[@]} -ne 0 ]; then echo "=== failed: ${failed[*]}"; exit 1; fi

@@ -92,54 +92,43 @@ TEST_F(EseLifecycle, CardPresentAndEmptyAtrWithoutAskingTheLibrary) {
   EXPECT_TRUE(logged(cap, "getAtr enter!", ANDROID_LOG_INFO));
 }
 
-TEST_F(EseLifecycle, TransmitRewritesOnlyCaseOneAndGetResponseCommands) {
-  const std::vector<std::pair<Bytes, const char*>> rows = {
-      // Mended: a 4-byte command gets Le 00 appended; its P2 stays P2.
-      {{0x00, 0xA4, 0x04, 0x0C}, "ipc 00 A4 04 0C 00"},
-      {{0x80, 0xC0, 0x00, 0x00}, "ipc 80 C0 00 00 00"},  // CLA kept
-      // A 5-byte GET RESPONSE keeps only the channel bits of CLA.
-      {{0xFF, 0xC0, 0x00, 0x00, 0x10}, "ipc 03 C0 00 00 10"},
-      {{0x84, 0xB0, 0x00, 0x00, 0x10}, "ipc 84 B0 00 00 10"},
-      {{0x81, 0xC0, 0x00, 0x00, 0x01, 0x20}, "ipc 81 C0 00 00 01 20"},
-      {{0x00, 0xA4, 0x04}, "ipc 00 A4 04"},
-      {{}, "ipc "},
-  };
-  for (const auto& row : rows) {
-    SCOPED_TRACE(row.second);
-    fake_ese::reset();
-    fake_ese::queueIpc({0, {0x90, 0x00}});
-    // Nothing but the one exchange: no READY, no power-off.
-    EXPECT_EQ(transmit(se, row.first), std::make_pair(1, Bytes{0x90, 0x00}));
-    EXPECT_EQ(fake_ese::calls(), (Calls{row.second, "result"}));
-  }
-}
-
-TEST_F(EseLifecycle, TransmitResponses) {
+TEST_F(EseLifecycle, TransmitRewritesCaseOneAndGetResponseAndPassesTheAnswerOn) {
   struct Row {
-    const char* name;
+    Bytes command;
+    const char* sent;  // nullptr: nothing reaches the library
     fake_ese::IpcReply reply;
     Bytes response;
-    const char* log;  // at error level
+    const char* log = nullptr;  // at error level
     unsigned allocFail = 0;
   };
+  const Bytes read{0x00, 0xB0, 0x00, 0x00, 0x02};
+  const char* readSent = "ipc 00 B0 00 00 02";
   const std::vector<Row> rows = {
-      {"ok 61xx passed as is", {0, {0x01, 0x61, 0x10}}, {0x01, 0x61, 0x10}, nullptr},
-      {"ok empty", {0, {}}, {}, nullptr},
-      {"failed, one byte back", {-1, {0x6F}}, {0x1F}, "transmit failed!!!"},
-      {"failed, 6F00 back", {-1, {0x6F, 0x00}}, {0x6F, 0x00}, "transmit failed!!!"},
-      {"claims more than the buffer", {0, Bytes(270, 0x33), 5000}, Bytes(270, 0x33), nullptr},
+      // Mended: a 4-byte command gets Le 00 appended; its P2 stays P2.
+      {{0x00, 0xA4, 0x04, 0x0C}, "ipc 00 A4 04 0C 00", {0, {0x90, 0x00}}, {0x90, 0x00}},
+      {{0x80, 0xC0, 0x00, 0x00}, "ipc 80 C0 00 00 00", {0, {0x90, 0x00}}, {0x90, 0x00}},
+      // A 5-byte GET RESPONSE keeps only the channel bits of CLA.
+      {{0xFF, 0xC0, 0x00, 0x00, 0x10}, "ipc 03 C0 00 00 10", {0, {0x61, 0x10}}, {0x61, 0x10}},
+      {{0x81, 0xC0, 0x00, 0x00, 0x01, 0x20}, "ipc 81 C0 00 00 01 20", {0, {1}}, {1}},
+      {{0x00, 0xA4, 0x04}, "ipc 00 A4 04", {0, {}}, {}},
+      {{}, "ipc ", {0, {0x6F}}, {0x6F}},
+      {read, readSent, {-1, {0x6F}}, {0x1F}, "transmit failed!!!"},
+      {read, readSent, {-1, {0x6F, 0x00}}, {0x6F, 0x00}, "transmit failed!!!"},
+      {read, readSent, {0, Bytes(270, 0x33), 5000}, Bytes(270, 0x33)},
       // Mended: a failed allocation still answers, with 1F.
-      {"command alloc fails", {}, {0x1F}, "transmit cmdApdu.p_data malloc fail!", 1},
-      {"response alloc fails", {}, {0x1F}, "transmit rspApdu.p_data malloc fail!", 2},
+      {read, nullptr, {}, {0x1F}, "transmit cmdApdu.p_data malloc fail!", 1},
+      {read, nullptr, {}, {0x1F}, "transmit rspApdu.p_data malloc fail!", 2},
   };
   for (const auto& row : rows) {
-    SCOPED_TRACE(row.name);
+    SCOPED_TRACE(fake_ese::hex(row.command) + " " + fake_ese::hex(row.reply.bytes));
     fake_ese::reset();
     cap.clear();
     fake_ese::queueIpc(row.reply);
     setBufferAllocFailureForTest(row.allocFail);
-    EXPECT_EQ(transmit(se, {0x00, 0xB0, 0x00, 0x00, 0x02}), std::make_pair(1, row.response));
+    EXPECT_EQ(transmit(se, row.command), std::make_pair(1, row.response));
     setBufferAllocFailureForTest(0);
+    // Nothing but the one exchange: no READY, no power-off.
+    EXPECT_EQ(fake_ese::calls(), (row.sent ? Calls{row.sent, "result"} : Calls{"result"}));
     EXPECT_TRUE(!row.log || logged(cap, row.log, ANDROID_LOG_ERROR));
     EXPECT_EQ(logged(cap, "transmit failed!!!", ANDROID_LOG_ERROR), row.reply.rc != 0);
   }
