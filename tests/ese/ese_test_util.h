@@ -1,10 +1,10 @@
 #pragma once
-// Shared pieces of the eSE front tests: a recording client callback, helpers
-// that run one operation and keep what its result callback got (noting
-// "result" in the fake library's call log when it runs), call log lines.
+// Shared pieces of the eSE front tests: a recording client, helpers that run
+// one operation and keep what its result callback got (noting "result" in the
+// fake library's call log when it runs), call log lines, the fixture.
+#include <algorithm>
 #include <atomic>
 #include <cstdint>
-#include <cstdio>
 #include <string>
 #include <vector>
 
@@ -23,19 +23,17 @@ using ::android::hardware::hidl_vec;
 using ::android::hardware::Return;
 using ::android::hardware::secure_element::V1_0::ISecureElementHalCallback;
 using ::android::hardware::secure_element::V1_0::LogicalChannelResponse;
-using ::android::hardware::secure_element::V1_0::SecureElementStatus;
 using ::android::hardware::secure_element::V1_0::implementation::SecureElement;
+using Status = ::android::hardware::secure_element::V1_0::SecureElementStatus;
 using Bytes = std::vector<uint8_t>;
 using Calls = std::vector<std::string>;
-using Status = SecureElementStatus;
 
 // The nth working-buffer allocation of the front from now on fails (1 = the
-// next one); 0 turns it off. Defined by the test allocator (failing_alloc.cpp).
+// next one); 0 turns it off. Defined by the test allocator, failing_alloc.cpp.
 void setBufferAllocFailureForTest(unsigned nth);
 
 struct FakeClient : public ISecureElementHalCallback {
-  std::atomic<int> connected{0};
-  std::atomic<int> disconnected{0};
+  std::atomic<int> connected{0}, disconnected{0};
   std::vector<uint64_t> linkCookies;
   std::vector<sp<hidl_death_recipient>> linkRecipients;
 
@@ -76,7 +74,7 @@ inline OpenResult openBasic(const sp<SecureElement>& se, const Bytes& aid, uint8
   return r;
 }
 
-// The response and how many times the callback ran.
+// How many times the callback ran, and the response.
 inline std::pair<int, Bytes> transmit(const sp<SecureElement>& se, const Bytes& apdu) {
   std::pair<int, Bytes> r{0, {}};
   se->transmit(apdu, [&](const hidl_vec<uint8_t>& resp) {
@@ -86,14 +84,13 @@ inline std::pair<int, Bytes> transmit(const sp<SecureElement>& se, const Bytes& 
   return r;
 }
 
-// A record with exactly this text, tag "qvese@1.0-service", main buffer and
-// the given priority.
+// A record with exactly this text and priority, under the front's tag in the
+// main buffer.
 inline bool logged(const ::android::host::LogCapture& cap, const std::string& text, int priority) {
-  for (const auto& rec : cap.records()) {
+  for (const auto& rec : cap.records())
     if (rec.text == text && rec.tag == "qvese@1.0-service" && rec.buffer == 0 &&
         rec.priority == priority)
       return true;
-  }
   return false;
 }
 
@@ -101,19 +98,14 @@ const Bytes kAid = {0xA0, 0x00, 0x00, 0x01, 0x51};
 constexpr const char* kManageOpen = "ipc 00 70 00 00 01";
 constexpr const char* kPowerOff = "power korva_poweroff";
 
-inline std::string hex2(uint8_t b) {
-  char buf[3];
-  std::snprintf(buf, sizeof(buf), "%02X", b);
-  return buf;
-}
+inline std::string hex2(uint8_t b) { return fake_ese::hex({b}); }
 
-// The call log line of a SELECT by DF name for kAid.
+// The call log lines of a SELECT by DF name for kAid, and of MANAGE CHANNEL
+// close for channel c.
 inline std::string selectLine(uint8_t cla, uint8_t p2) {
   return "trx " + hex2(cla) + " A4 04 " + hex2(p2) + " lc=5 " + fake_ese::hex(kAid) +
          " le_type=1 le=256 rlen=2";
 }
-
-// The call log line of MANAGE CHANNEL close for channel c.
 inline std::string closeLine(uint8_t c) {
   return "trx " + hex2(c) + " 70 80 " + hex2(c) + " lc=0 le_type=0 le=36864 rlen=0";
 }
@@ -133,9 +125,10 @@ inline std::vector<uint8_t> sweepFlags(const sp<SecureElement>& se) {
   for (int i = 0; i < 3; ++i) fake_ese::queueTransceive({0, {}, 0x90, 0x00});
   se->init(new FakeClient());
   std::vector<uint8_t> closed;
-  for (const auto& line : fake_ese::calls())
-    for (uint8_t c = 1; c <= 3; ++c)
-      if (line == closeLine(c)) closed.push_back(c);
+  for (uint8_t c = 1; c <= 3; ++c) {
+    const Calls calls = fake_ese::calls();
+    if (std::find(calls.begin(), calls.end(), closeLine(c)) != calls.end()) closed.push_back(c);
+  }
   fake_ese::reset();
   return closed;
 }

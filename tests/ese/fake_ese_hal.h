@@ -1,8 +1,8 @@
 #pragma once
 // A scripted stand-in for the vendor eSE library, linked into test programs in
 // place of libese_qv_hal.so. Each exchange answers from its own queue of
-// scripted replies (a failure when the queue is empty) and every call is
-// written to one call log, a line of text each, so a test compares the whole
+// scripted replies (a failure when the queue is empty); every call goes to one
+// call log, a line of text each, so that a test compares the whole
 // conversation with the library, its own result callbacks included, at once.
 #include <cstdint>
 #include <string>
@@ -10,16 +10,16 @@
 
 namespace fake_ese {
 
-// A reply of phQVNciHal_Transmit_APDU_by_IPC: `bytes` go into the caller's
-// 270-byte buffer; `reportedLen`, when not negative, is put in `len` instead.
+// phQVNciHal_Transmit_APDU_by_IPC: `bytes` go into the caller's 270-byte
+// buffer; `reportedLen`, when not negative, is put in `len` instead.
 struct IpcReply {
   int32_t rc = 0;
   std::vector<uint8_t> bytes;
   long reportedLen = -1;
 };
 
-// A reply of phQvEse_7816_Transceive: `data` into the caller's buffer, SW1 SW2
-// into the record (also when rc is not 0).
+// phQvEse_7816_Transceive: `data` into the caller's buffer, SW1 SW2 into the
+// record (also when rc is not 0).
 struct TransceiveReply {
   int32_t rc = 0;
   std::vector<uint8_t> data;
@@ -28,8 +28,7 @@ struct TransceiveReply {
   long reportedLen = -1;
 };
 
-// Empty queues and log, every plain call answering 0, the eSE type 1.
-void reset();
+void reset();  // empty queues and log, every plain call answering 0, eSE type 1
 void queueIpc(const IpcReply& reply);
 void queueTransceive(const TransceiveReply& reply);
 void setReadyResult(int32_t rc);      // phQVNciHal_Set_KORVA_READY
@@ -37,21 +36,19 @@ void setReadyStatus(int32_t status);  // phQVNciHal_Get_KORVA_Ready_Status
 void setInitOpenResult(int32_t rc);   // phQvEse_init_open
 void setEseType(int32_t type);        // get_korva_exist_flag
 
-// The log, one line per call: "type" "open" "close" "ready" "status"
-// "power korva_poweroff", "ipc 00 70 00 00 01" (the command bytes),
-// "trx 01 A4 04 00 lc=2 A0 01 le_type=1 le=256 rlen=2"; plus what a test
-// notes itself (e.g. "result" when a result callback runs).
+// One line per call: "type" "open" "close" "ready" "status" "power korva_poweroff",
+// "ipc 00 70 00 00 01" (the command), "trx 01 A4 04 00 lc=2 A0 01 le_type=1
+// le=256 rlen=2" (the record); and what a test notes, e.g. "result".
 std::vector<std::string> calls();
 void clearCalls();
 void note(const std::string& line);
 
-// The next IPC exchange reports that it has begun, then waits until
-// releaseBlockedIpc() before it answers, so a test can hold the eSE lock.
+// The next IPC exchange reports that it has begun, then waits for
+// releaseBlockedIpc() before it answers, so that a test can hold the eSE lock.
 void blockNextIpc();
 bool waitIpcBlocked(int timeoutMs);
 void releaseBlockedIpc();
-// Waits (up to timeoutMs) until a line equal to `line` is in the log.
-bool waitForCall(const std::string& line, int timeoutMs);
+bool waitForCall(const std::string& line, int timeoutMs);  // until `line` is logged
 
 std::string hex(const std::vector<uint8_t>& bytes);  // "00 A4 04 00"
 
