@@ -1,6 +1,7 @@
 // End to end: the real daemon with the simulated vendor library in a fresh
 // device root, driven by the real secli over the daemon's sockets. A killed
-// client and the start without an eSE are in the integration suite.
+// client, the instance list and the start without an eSE are in the
+// integration suite; the status word and P2 rules in the unit tests.
 #include <gtest/gtest.h>
 
 #include <signal.h>
@@ -18,7 +19,6 @@ using namespace se_test;
 // The card's applets (card/card_applets.h).
 constexpr const char* kEchoAid = "A00000000101";
 constexpr const char* kBigAid = "A00000000102";
-constexpr const char* kP2Aid = "A00000000103";
 constexpr const char* kMissingAid = "A00000000199";
 
 class EseEndToEnd : public ::testing::Test {
@@ -70,13 +70,6 @@ TEST_F(EseEndToEnd, ChannelsAndApdusThroughTheDaemon) {
   EXPECT_EQ(field(s.call("close " + std::to_string(echo)), "status"), "SUCCESS");
   EXPECT_EQ(field(s.call("close " + std::to_string(big)), "status"), "SUCCESS");
 
-  // P2 7F reaches the card as 00 on a logical channel.
-  open = s.call(std::string("open ") + kP2Aid + " 0x7F");
-  EXPECT_EQ(field(open, "status"), "SUCCESS");
-  const int p2 = std::atoi(field(open, "channel").c_str());
-  EXPECT_EQ(field(s.call("transmit " + hexByte(p2) + " 20 00 00 00"), "response"), "009000");
-  EXPECT_EQ(field(s.call("close " + std::to_string(p2)), "status"), "SUCCESS");
-
   // The basic channel; an exchange on it.
   const std::string basic = s.call(std::string("basic ") + kEchoAid);
   EXPECT_EQ(field(basic, "status"), "SUCCESS");
@@ -91,18 +84,6 @@ TEST_F(EseEndToEnd, ChannelsAndApdusThroughTheDaemon) {
 
   s.process().closeStdin();
   EXPECT_EQ(s.process().waitExit(), 0);
-}
-
-TEST_F(EseEndToEnd, WithAnEseBothInstancesAreServed) {
-  ASSERT_NO_FATAL_FAILURE(startDaemon());
-  std::string out;
-  EXPECT_EQ(secli(root, {"list"}, &out), 0);
-  EXPECT_NE(out.find("eSE1"), std::string::npos) << out;
-  EXPECT_NE(out.find("SIM1"), std::string::npos) << out;
-  // eSE1 was registered before SIM1.
-  const std::string log = daemon->err().text();
-  EXPECT_LT(log.find("SecureElement Registered eSE1 success"),
-            log.find("ZerbSimSecureElement Registered sim1 success"));
 }
 
 }  // namespace
