@@ -36,7 +36,7 @@ whole_runs() {
   [ -e "${bins[0]}" ] || { echo "no test binaries in $dir/bin"; return 1; }
   printf '%s\n' "${bins[@]}" | xargs -P "$jobs" -I{} sh -c '
     b=$1; shift; log="$0/whole-runs/$(basename "$b").log"
-    if "$@" timeout 900 "$b" --gtest_shuffle >"$log" 2>&1; then
+    if "$@" timeout 600 "$b" --gtest_shuffle >"$log" 2>&1; then
       printf "whole %-28s ok\n" "$(basename "$b")"
     else
       printf "whole %-28s FAIL (%s)\n" "$(basename "$b")" "$log"
