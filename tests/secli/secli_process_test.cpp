@@ -2,109 +2,42 @@
 // socket by this test process.
 #include <gtest/gtest.h>
 
-#include <fcntl.h>
 #include <signal.h>
-#include <spawn.h>
-#include <sys/wait.h>
 
 #include <fstream>
-#include <sstream>
 
 #include "../platform/rpc_test_util.h"
-
-extern char** environ;
+#include "se_harness.h"
 
 namespace {
 
 using namespace fake;
-
-struct Proc {
-  pid_t pid = -1;
-  int in = -1, out = -1, err = -1;
-};
-
-Proc spawnSecli(const std::vector<std::string>& args) {
-  int in[2], out[2], err[2];
-  Proc p;
-  if (pipe2(in, O_CLOEXEC) || pipe2(out, O_CLOEXEC) || pipe2(err, O_CLOEXEC)) return p;
-  posix_spawn_file_actions_t fa;
-  posix_spawn_file_actions_init(&fa);
-  posix_spawn_file_actions_adddup2(&fa, in[0], 0);
-  posix_spawn_file_actions_adddup2(&fa, out[1], 1);
-  posix_spawn_file_actions_adddup2(&fa, err[1], 2);
-  std::vector<std::string> all = {SECLI_PATH};
-  all.insert(all.end(), args.begin(), args.end());
-  std::vector<char*> argv;
-  for (auto& a : all) argv.push_back(const_cast<char*>(a.c_str()));
-  argv.push_back(nullptr);
-  if (posix_spawn(&p.pid, SECLI_PATH, &fa, nullptr, argv.data(), environ) != 0) p.pid = -1;
-  posix_spawn_file_actions_destroy(&fa);
-  close(in[0]);
-  close(out[1]);
-  close(err[1]);
-  p.in = in[1];
-  p.out = out[0];
-  p.err = err[0];
-  return p;
-}
-
-// Reads one line from `fd` (without the newline), waiting at most the test limit.
-bool readLine(int fd, std::string* line) {
-  line->clear();
-  for (;;) {
-    pollfd pfd{fd, POLLIN, 0};
-    if (poll(&pfd, 1, 10000) != 1) return false;
-    char c;
-    if (read(fd, &c, 1) != 1) return false;
-    if (c == '\n') return true;
-    *line += c;
-  }
-}
+using se_test::Process;
 
 struct Outcome {
   int status = -1;
   std::string out, err;
 };
 
-// Feeds `input`, closes standard input and collects everything until exit.
-Outcome finish(Proc& p, const std::string& input = "") {
-  Outcome o;
-  if (!input.empty() && write(p.in, input.data(), input.size()) != static_cast<ssize_t>(input.size())) {
-    ADD_FAILURE() << "cannot feed secli";
-  }
-  close(p.in);
-  p.in = -1;
-  bool outOpen = true, errOpen = true;
-  while (outOpen || errOpen) {
-    pollfd pfds[2] = {{outOpen ? p.out : -1, POLLIN, 0}, {errOpen ? p.err : -1, POLLIN, 0}};
-    if (poll(pfds, 2, 10000) <= 0) {
-      ADD_FAILURE() << "secli did not finish";
-      kill(p.pid, SIGKILL);
-      break;
-    }
-    char buf[4096];
-    for (int i = 0; i < 2; ++i) {
-      if (!(pfds[i].revents & (POLLIN | POLLHUP))) continue;
-      ssize_t n = read(pfds[i].fd, buf, sizeof(buf));
-      if (n <= 0) {
-        (i == 0 ? outOpen : errOpen) = false;
-      } else {
-        (i == 0 ? o.out : o.err).append(buf, static_cast<size_t>(n));
-      }
-    }
-  }
-  close(p.out);
-  close(p.err);
-  int st = 0;
-  waitpid(p.pid, &st, 0);
-  o.status = WIFEXITED(st) ? WEXITSTATUS(st) : -1;
-  return o;
+// The test's own device root (set by the fixture's TempRoot), for the child.
+std::string deviceRoot() {
+  const char* r = getenv("SE_DEVICE_ROOT");
+  return r ? r : "/";
 }
 
+// secli with these arguments, its standard input fed `input` and closed; what
+// it wrote, once it has ended.
 Outcome runSecli(const std::vector<std::string>& args, const std::string& input = "") {
-  Proc p = spawnSecli(args);
-  EXPECT_GT(p.pid, 0);
-  return finish(p, input);
+  std::vector<std::string> argv = {SECLI_PATH};
+  argv.insert(argv.end(), args.begin(), args.end());
+  Process p(argv, deviceRoot());
+  if (!input.empty()) p.write(input);
+  p.closeStdin();
+  Outcome o;
+  o.status = p.waitExit();
+  o.out = p.out().text();
+  o.err = p.err().text();
+  return o;
 }
 
 size_t lineCount(const std::string& s) { return std::count(s.begin(), s.end(), '\n'); }
@@ -210,38 +143,31 @@ TEST_F(SecliProcessTest, ScriptFileIsCheckedBeforeAnythingRuns) {
 TEST_F(SecliProcessTest, InitWaitsForALateStateChangeUpToTheTimeout) {
   se->deferStateChange = true;
   start();
-  Proc p = spawnSecli({"--root", root.path(), "--json", "--timeout", "10", "-i", "SIM1", "init"});
+  Process p({SECLI_PATH, "--root", root.path(), "--json", "--timeout", "10", "-i", "SIM1", "init"}, deviceRoot());
   ASSERT_TRUE(se->waitInit());
   // Returns once secli has read and answered the call.
   EXPECT_TRUE(se->callback()->onStateChange(true).isOk());
-  Outcome o = finish(p);
-  EXPECT_EQ(o.status, 0);
-  EXPECT_EQ(o.out, "{\"cmd\":\"init\",\"state\":true}\n");
+  EXPECT_EQ(p.waitExit(), 0);
+  EXPECT_EQ(p.out().text(), "{\"cmd\":\"init\",\"state\":true}\n");
 
-  o = runSecli({"--root", root.path(), "--json", "--timeout", "0.2", "-i", "SIM1", "init"});
+  Outcome o = runSecli({"--root", root.path(), "--json", "--timeout", "0.2", "-i", "SIM1", "init"});
   EXPECT_EQ(o.status, 0);
   EXPECT_EQ(o.out, "{\"cmd\":\"init\",\"state\":null}\n");
 }
 
 TEST_F(SecliProcessTest, KillingSecliMidScriptMakesTheServerSeeServiceDied) {
   start();
-  Proc p = spawnSecli({"--root", root.path(), "--json", "-i", "SIM1", "-f", "-"});
-  ASSERT_GT(p.pid, 0);
-  const std::string first = "init\npresent\n";
-  ASSERT_EQ(write(p.in, first.data(), first.size()), static_cast<ssize_t>(first.size()));
+  Process p({SECLI_PATH, "--root", root.path(), "--json", "-i", "SIM1", "-f", "-"}, deviceRoot());
+  p.write("init\npresent\n");
+  size_t pos = 0;
   std::string line;
-  ASSERT_TRUE(readLine(p.out, &line));
+  ASSERT_TRUE(p.out().nextLine(&pos, &line));
   EXPECT_EQ(line, "{\"cmd\":\"init\",\"state\":true}");
-  ASSERT_TRUE(readLine(p.out, &line));
+  ASSERT_TRUE(p.out().nextLine(&pos, &line));
   EXPECT_TRUE(se->watcher->cookies().empty());
-  kill(p.pid, SIGKILL);
-  int st;
-  waitpid(p.pid, &st, 0);
+  p.stop(SIGKILL);
   EXPECT_TRUE(se->watcher->waitDeaths(1));
   EXPECT_EQ(se->watcher->cookies(), std::vector<uint64_t>{0});
-  close(p.in);
-  close(p.out);
-  close(p.err);
 }
 
 TEST_F(SecliProcessTest, ListShowsRegisteredInstances) {
