@@ -1,21 +1,20 @@
 // modem-sim as a real process over its pty.
 #include <gtest/gtest.h>
 
-#include <errno.h>
 #include <fcntl.h>
 #include <poll.h>
 #include <signal.h>
-#include <stdlib.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
 #include <chrono>
-#include <filesystem>
 #include <fstream>
 #include <sstream>
 #include <string>
 #include <vector>
+
+#include "se_harness.h"
 
 namespace {
 
@@ -24,50 +23,24 @@ constexpr int kTimeoutMs = 5000;
 
 bool isFinal(const std::string& l) { return l == "OK" || l == "ERROR" || l.rfind("+CME ERROR:", 0) == 0; }
 
+// modem-sim in a fresh device root, logging to a file; the test speaks to
+// its port as the daemon would.
 class Sim {
  public:
-  explicit Sim(std::vector<std::string> args, int modem = 0) {
-    char tmpl[] = "/tmp/modem_sim_test.XXXXXX";
-    root_ = mkdtemp(tmpl);
-    logPath_ = root_ + "/sim.log";
-    port_ = root_ + (modem == 0 ? "/dev/appvcom18" : "/dev/appvcom34");
-    args.insert(args.begin(), {MODEM_SIM_PATH, "--root", root_, "--log", logPath_});
-    int out[2];
-    if (pipe(out) != 0) abort();
-    pid_ = fork();
-    if (pid_ == 0) {
-      dup2(out[1], 1);
-      close(out[0]);
-      close(out[1]);
-      std::vector<char*> argv;
-      for (auto& a : args) argv.push_back(const_cast<char*>(a.c_str()));
-      argv.push_back(nullptr);
-      execv(argv[0], argv.data());
-      _exit(127);
-    }
-    close(out[1]);
-    stdout_ = out[0];
-  }
+  explicit Sim(std::vector<std::string> args, int modem = 0)
+      : logPath_(root_.at("sim.log")),
+        port_(root_.at(modem == 0 ? "dev/appvcom18" : "dev/appvcom34")),
+        proc_(withProgram(args, root_.path(), logPath_), root_.path()) {}
   ~Sim() {
     if (fd_ >= 0) close(fd_);
-    if (pid_ > 0) {
-      kill(pid_, SIGKILL);
-      waitpid(pid_, nullptr, 0);
-    }
-    close(stdout_);
-    std::filesystem::remove_all(root_);
   }
 
   // The one ready line on standard output.
   std::string readyLine() {
-    std::string s;
-    char c;
-    while (s.find('\n') == std::string::npos) {
-      struct pollfd p = {stdout_, POLLIN, 0};
-      if (poll(&p, 1, kTimeoutMs) <= 0 || read(stdout_, &c, 1) != 1) break;
-      s.push_back(c);
-    }
-    return s;
+    std::string line;
+    size_t pos = 0;
+    proc_.out().nextLine(&pos, &line, kTimeoutMs);
+    return line;
   }
   bool openPort() {
     if (fd_ >= 0) close(fd_);
@@ -112,11 +85,8 @@ class Sim {
     return answer();
   }
   int terminate() {
-    kill(pid_, SIGTERM);
-    int status = 0;
-    waitpid(pid_, &status, 0);
-    pid_ = -1;
-    return WIFEXITED(status) ? WEXITSTATUS(status) : -1;
+    proc_.stop(SIGTERM);
+    return proc_.waitExit();
   }
   std::string log() const {
     std::ifstream in(logPath_);
@@ -127,9 +97,14 @@ class Sim {
   const std::string& port() const { return port_; }
 
  private:
-  std::string root_, logPath_, port_, buf_;
-  pid_t pid_ = -1;
-  int stdout_ = -1;
+  static std::vector<std::string> withProgram(std::vector<std::string> args, const std::string& root,
+                                              const std::string& log) {
+    args.insert(args.begin(), {MODEM_SIM_PATH, "--root", root, "--log", log});
+    return args;
+  }
+  se_test::TempRoot root_;
+  std::string logPath_, port_, buf_;
+  se_test::Process proc_;
   int fd_ = -1;
 };
 
