@@ -110,41 +110,43 @@ TEST_F(EseSimTest, ExchangesFailUntilOpenedAndAfterClose) {
 }
 
 TEST_F(EseSimTest, FaultSwitchesActAtRunTime) {
+  EXPECT_EQ(phQVNciHal_Set_KORVA_READY(), 0);
   EXPECT_EQ(phQVNciHal_Get_KORVA_Ready_Status(), 0);
+  setProp("vendor.ese_sim.fail_ready", "1");
   setProp("vendor.ese_sim.ready_status", "5");
+  EXPECT_NE(phQVNciHal_Set_KORVA_READY(), 0);
   EXPECT_EQ(phQVNciHal_Get_KORVA_Ready_Status(), 5);
-  for (const char* v : {"1", "0"}) {
-    setProp("vendor.ese_sim.fail_ready", v);
-    EXPECT_EQ(phQVNciHal_Set_KORVA_READY() != 0, *v == '1');
-  }
-  for (const char* v : {"true", "0"}) {
-    setProp("vendor.ese_sim.fail_open", v);
-    EXPECT_EQ(phQvEse_init_open() != 0, *v == 't');
-  }
-  // A failing exchange hands back no status, or the one the switch names.
-  struct Row {
-    const char* value;
-    bool fails;
-    Bytes ipcOut;
-    uint8_t sw1, sw2;
-  };
-  const Row rows[] = {{"1", true, {}, 0, 0},
-                      {"6a82", true, {0x6A, 0x82}, 0x6A, 0x82},
-                      {"0", false, {0x01, 0x90, 0x00}, 0x90, 0x00}};
-  for (const Row& row : rows) {
-    SCOPED_TRACE(row.value);
-    setProp("vendor.ese_sim.fail_exchange", row.value);
-    Bytes out;
-    EXPECT_EQ(ipc({0x00, 0x70, 0x00, 0x00, 0x01}, out) != 0, row.fails);
-    EXPECT_EQ(out, row.ipcOut);
-    TransceiveResult t = transceive(0x00, 0xA4, 0x04, 0x00, se_card::aid::kEcho, true);
-    EXPECT_EQ(t.rc != 0, row.fails);
-    EXPECT_EQ(t.sw1, row.sw1);
-    EXPECT_EQ(t.sw2, row.sw2);
-  }
-  // The power-off request leaves open channels alone.
-  EXPECT_EQ(phQVNciHal_Set_KORVA_Power("korva_poweroff"), 0);
+  setProp("vendor.ese_sim.fail_ready", "0");
+  EXPECT_EQ(phQVNciHal_Set_KORVA_READY(), 0);
+
+  setProp("vendor.ese_sim.fail_open", "true");
+  EXPECT_NE(phQvEse_init_open(), 0);
+  setProp("vendor.ese_sim.fail_open", "0");
+  ASSERT_EQ(phQvEse_init_open(), 0);
+
   Bytes out;
+  setProp("vendor.ese_sim.fail_exchange", "1");
+  EXPECT_NE(ipc({0x00, 0x70, 0x00, 0x00, 0x01}, out), 0);
+  EXPECT_TRUE(out.empty());
+  TransceiveResult t = transceive(0x00, 0xA4, 0x04, 0x00, se_card::aid::kEcho, true);
+  EXPECT_NE(t.rc, 0);
+  EXPECT_EQ(t.sw1, 0);
+  EXPECT_EQ(t.sw2, 0);
+  EXPECT_TRUE(t.data.empty());
+
+  setProp("vendor.ese_sim.fail_exchange", "6a82");
+  EXPECT_NE(ipc({0x00, 0x70, 0x00, 0x00, 0x01}, out), 0);
+  EXPECT_EQ(out, (Bytes{0x6A, 0x82}));
+  t = transceive(0x00, 0xA4, 0x04, 0x00, se_card::aid::kEcho, true);
+  EXPECT_NE(t.rc, 0);
+  EXPECT_EQ(t.sw1, 0x6A);
+  EXPECT_EQ(t.sw2, 0x82);
+
+  setProp("vendor.ese_sim.fail_exchange", "0");
+  EXPECT_EQ(ipc({0x00, 0x70, 0x00, 0x00, 0x01}, out), 0);
+  EXPECT_EQ(out, (Bytes{0x01, 0x90, 0x00}));
+  EXPECT_EQ(phQVNciHal_Set_KORVA_Power("korva_poweroff"), 0);
+  // The power-off request leaves open channels alone.
   EXPECT_EQ(ipc({0x01, 0xCA, 0x00, 0x66, 0x00}, out), 0);
   EXPECT_EQ(out[out.size() - 2], 0x90);
 }
