@@ -120,9 +120,8 @@ TEST_F(EseLifecycle, TransmitRewritesCaseOneAndGetResponseAndPassesTheAnswerOn) 
 constexpr auto kGenerous = std::chrono::seconds(10);
 
 // Runs `op` on a thread of its own and comes back once the thread has either
-// finished or gone to sleep. Holding the lock, the test sees the thread asleep
-// when it waits for that lock: the fake library, the only other place it could
-// wait, is not reached while the lock is held.
+// finished or gone to sleep. While the test holds the lock, a thread asleep is
+// one waiting for it: nothing else in these operations or the fake sleeps.
 class Contender {
  public:
   explicit Contender(std::function<void()> op)
@@ -149,22 +148,34 @@ class Contender {
   std::future<void> done_;
 };
 
-// Holds the eSE lock: a transmit whose exchange waits until release().
+// Holds the eSE lock: a transmit whose result callback, which runs under the
+// lock, waits until release() notes "released" in the call log.
 class LockHolder {
  public:
   explicit LockHolder(const sp<SecureElement>& se) {
-    fake_ese::blockNextIpc();
     fake_ese::queueIpc({0, {0x90, 0x00}});
-    done_ = std::async(std::launch::async, [se] { transmit(se, {0x00, 0xCA, 0x00, 0x00, 0x00}); });
-    EXPECT_TRUE(fake_ese::waitIpcBlocked(10000));
+    done_ = std::async(std::launch::async, [this, se] {
+      se->transmit(Bytes{0x00, 0xCA, 0x00, 0x00, 0x00}, [this](const hidl_vec<uint8_t>&) {
+        entered_.set_value();
+        release_.wait();
+      });
+    });
+    entered_.get_future().wait();
   }
   ~LockHolder() { release(); }
   void release() {
-    fake_ese::releaseBlockedIpc();
+    if (!released_) {
+      released_ = true;
+      fake_ese::note("released");
+      go_.set_value();
+    }
     done_.wait();
   }
 
  private:
+  std::promise<void> entered_, go_;
+  std::shared_future<void> release_ = go_.get_future().share();
+  bool released_ = false;
   std::future<void> done_;
 };
 
@@ -196,12 +207,12 @@ TEST_F(EseLifecycle, ChannelOperationsAndTransmitWaitForTheLockTheOthersDoNot) {
     }
     holder.release();
     ASSERT_TRUE(contender.finishes());
-    // The holder's result comes before the contender's first call exactly when it waits.
+    // The lock is released before the contender's first call exactly when it waits.
     const Calls calls = fake_ese::calls();
     const auto at = [&](const std::string& line) { return std::find(calls.begin(), calls.end(), line); };
     ASSERT_EQ(calls.front(), held);
     ASSERT_NE(at(row.first), calls.end());
-    EXPECT_EQ(at("result") < at(row.first), row.waits);
+    EXPECT_EQ(at("released") < at(row.first), row.waits);
   }
 }
 

@@ -43,13 +43,6 @@ std::vector<std::string> calls();
 void clearCalls();
 void note(const std::string& line);
 
-// The next IPC exchange reports that it has begun, then waits for
-// releaseBlockedIpc() before it answers, so that a test can hold the eSE lock.
-void blockNextIpc();
-bool waitIpcBlocked(int timeoutMs);
-void releaseBlockedIpc();
-bool waitForCall(const std::string& line, int timeoutMs);  // until `line` is logged
-
 std::string hex(const std::vector<uint8_t>& bytes);  // "00 A4 04 00"
 
 }  // namespace fake_ese
