@@ -39,10 +39,8 @@ TEST_F(EseChannels, ManageChannelRefusalsGiveNoChannelAndPowerOff) {
       {"one byte", {0, {0x01}}, 0xFF, Status::FAILED, {}},
       // 90 00 with no channel byte in front of it names no channel.
       {"9000 alone", {0, {0x90, 0x00}}, 0xFF, Status::FAILED, {0x90, 0x00}},
-      // Mended: channels above 3 cannot be addressed by CLA = channel nor kept
-      // in the table; they are refused and the power-off releases them.
-      {"channel 4", {0, {0x04, 0x90, 0x00}}, 0xFF, Status::CHANNEL_NOT_AVAILABLE, {0x04, 0x90, 0x00}},
-      {"channel 255", {0, {0xFF, 0x90, 0x00}}, 0xFF, Status::CHANNEL_NOT_AVAILABLE, {0xFF, 0x90, 0x00}},
+      // Channels above 3 are refused too, after a close on the card
+      // (SecureElement_faults_test.cpp).
       // The exchange itself failed: marker 7E; bytes it left still become the
       // select response.
       {"ipc failed", {-1, {}}, 0x7E, Status::FAILED, {}},

@@ -266,10 +266,20 @@ TEST_F(EseLifecycle, InitAndServiceDiedDoNotWaitForTheLock) {
   ASSERT_EQ(openLogical(se, kAid, 0).status, Status::SUCCESS);
 
   fake_ese::clearCalls();
-  fake_ese::blockNextIpc();
   fake_ese::queueIpc({0, {0x90, 0x00}});
-  auto holder = runAsync([&] { transmit(se, {0x00, 0xCA, 0x00, 0x00, 0x00}); });
-  ASSERT_TRUE(fake_ese::waitIpcBlocked(kGenerousMs));
+  // The holder keeps the lock in its result callback, out of the library.
+  std::promise<void> inCallback;
+  std::promise<void> letGo;
+  std::shared_future<void> letGoSignal = letGo.get_future().share();
+  auto holder = runAsync([&] {
+    se->transmit(hidl_vec<uint8_t>(Bytes{0x00, 0xCA, 0x00, 0x00, 0x00}),
+                 [&](const hidl_vec<uint8_t>&) {
+                   inCallback.set_value();
+                   letGoSignal.wait();
+                 });
+  });
+  ASSERT_EQ(inCallback.get_future().wait_for(std::chrono::milliseconds(kGenerousMs)),
+            std::future_status::ready);
 
   fake_ese::queueTransceive({0, {}, 0x90, 0x00});
   auto initCall = runAsync([&] { se->init(client); });
@@ -279,7 +289,7 @@ TEST_F(EseLifecycle, InitAndServiceDiedDoNotWaitForTheLock) {
   auto presentCall = runAsync([&] { se->isCardPresent(); });
   const bool presentDone = finishes(presentCall, kGenerousMs);
 
-  fake_ese::releaseBlockedIpc();  // before asserting, so nothing is left waiting
+  letGo.set_value();  // before asserting, so nothing is left waiting
   EXPECT_TRUE(initDone);
   EXPECT_TRUE(diedDone);
   EXPECT_TRUE(presentDone);
