@@ -193,6 +193,7 @@ TEST_P(SimFaults, AHungVendorCallLeavesSim1Answering) {
   victim->process().stop(SIGKILL);
   EXPECT_TRUE(daemon->err().waitFor("serviceDied: the eSE library is in a call for", mark));
   EXPECT_LT(msSince(t0), 1000);
+  RecordProperty("ese_death_notice_ms", static_cast<int>(msSince(t0)));
   victim.reset();
   EXPECT_EQ(echo(sim, simCh, "C4"), "C49000");
 
