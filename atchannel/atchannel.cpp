@@ -511,10 +511,19 @@ void at_close(void) {
   AT_LOGI("m%d_%d>at close.", static_cast<int32_t>(g_ulModemId), ac->index);
   // request_lock stays: a command issued after the close still takes it and
   // must find a valid mutex (it then ends with -3).
-  MutexGuard attrs(&g_attrLock);
-  if (g_attrInited[ac->index]) {
-    pthread_attr_destroy(&reader_thread_attrs[ac->index]);
-    g_attrInited[ac->index] = false;
+  {
+    MutexGuard attrs(&g_attrLock);
+    if (g_attrInited[ac->index]) {
+      pthread_attr_destroy(&reader_thread_attrs[ac->index]);
+      g_attrInited[ac->index] = false;
+    }
+  }
+  // The reader was woken above and leaves at once; waiting for it means a
+  // closed port has no thread left reading or logging for it. The reader
+  // itself (closing from its handler) cannot wait for its own end.
+  if (t_readerOf != ac) {
+    MutexGuard g(&ac->port_lock);
+    while (ac->reader_running != 0) pthread_cond_wait(&ac->reader_gone_cond, &ac->port_lock);
   }
 }
 
