@@ -147,7 +147,13 @@ TEST_P(SimFaults, ASilentModemLeavesEse1Answering) {
   EXPECT_TRUE(daemon->err().waitFor("SIM busy: call given up"));
   std::string line;
   EXPECT_FALSE(sim.answer(&line, 0)) << "the silent modem answered: " << line;
-  sim.process().stop(SIGKILL);  // its call would wait for secli's time-out
+
+  // The stuck client itself dies: its death notice is taken as well.
+  mark = daemon->err().size();
+  t0 = Clock::now();
+  sim.process().stop(SIGKILL);
+  EXPECT_TRUE(daemon->err().waitFor("ZerbSimSecureElement: serviceDied, enter", mark));
+  EXPECT_LT(msSince(t0), 1000);
 }
 
 // A vendor library call that hangs: SIM1 is served within a second, other
