@@ -188,6 +188,7 @@ TEST_F(Engine, LostPortIsReopenedAndItsChannelsAreGone) {
   EXPECT_EQ(1, open.get());
   EXPECT_TRUE(cap.contains("transmit_select_cmd:cmd return errno=-3", kTag));
   EXPECT_FALSE(cap.contains("AT+CCHC"));
+  EXPECT_FALSE(cap.contains("release of modem session"));
   ASSERT_TRUE(waitUntil([&] { return cap.contains("cmdloop[0] AT port lost", kTag); }));
   EXPECT_EQ(ANDROID_LOG_ERROR, cap.find("cmdloop[0] AT port lost", kTag)[0].priority);
   EXPECT_EQ(-1, push(0, REQUEST_GET_CARD_PRESENT, {}));

@@ -361,8 +361,9 @@ TEST_F(Front, SilentModemDoesNotHoldUpOtherCallers) {
   EXPECT_EQ((std::vector<uint8_t>{0x90, 0x00}), transmit({0x00, 0xB0, 0x00, 0x00}));
 }
 
-// Several callers on a working but slow modem (each answer takes 100 ms)
-// all wait their turn and get their own answers.
+// Several callers on a working but slow modem (each answer takes 100 ms, so
+// the last caller waits far longer than the silence bound) all wait their
+// turn and get their own answers.
 TEST_F(Front, ConcurrentCallersOnAWorkingModemAreAllServed) {
   se_delay::setDivisorForTest(1);
   initAndWait();
@@ -371,7 +372,7 @@ TEST_F(Front, ConcurrentCallersOnAWorkingModemAreAllServed) {
     const std::string hex = cmd.substr(cmd.find('"') + 1, 4);
     m.send(okLine("+CSIM: 6,\"" + hex.substr(2, 2) + "9000\""));
   });
-  constexpr int kCallers = 4;
+  constexpr int kCallers = 8;
   LogCapture cap;
   std::vector<std::future<std::vector<uint8_t>>> calls;
   for (int i = 0; i < kCallers; i++) {
