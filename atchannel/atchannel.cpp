@@ -36,6 +36,8 @@ constexpr uint64_t kWriteRetryMicros = 1000000ULL;
 // Pause after a zero-byte read before the port is read again.
 constexpr uint64_t kEofRetryMicros = 1000000ULL;
 constexpr int32_t kWriteAttempts = 5;
+// How long at_close waits for the port's reader to leave.
+constexpr time_t kReaderLeaveSeconds = 1;
 constexpr int32_t kModemSlots = 2;
 
 pthread_key_t ac_key;
@@ -519,11 +521,20 @@ void at_close(void) {
     }
   }
   // The reader was woken above and leaves at once; waiting for it means a
-  // closed port has no thread left reading or logging for it. The reader
-  // itself (closing from its handler) cannot wait for its own end.
+  // closed port has no thread left reading or logging for it. The wait is
+  // bounded, so that a driver whose read blocks cannot stall the close; the
+  // reader itself (closing from its handler) cannot wait for its own end.
   if (t_readerOf != ac) {
+    struct timespec deadline;
+    clock_gettime(CLOCK_REALTIME, &deadline);
+    deadline.tv_sec += kReaderLeaveSeconds;
     MutexGuard g(&ac->port_lock);
-    while (ac->reader_running != 0) pthread_cond_wait(&ac->reader_gone_cond, &ac->port_lock);
+    while (ac->reader_running != 0) {
+      if (pthread_cond_timedwait(&ac->reader_gone_cond, &ac->port_lock, &deadline) == ETIMEDOUT) {
+        AT_LOGE("m%d_%d>reader still busy after close", static_cast<int32_t>(g_ulModemId), ac->index);
+        break;
+      }
+    }
   }
 }
 

@@ -361,8 +361,9 @@ TEST_F(Front, SilentModemDoesNotHoldUpOtherCallers) {
   EXPECT_EQ((std::vector<uint8_t>{0x90, 0x00}), transmit({0x00, 0xB0, 0x00, 0x00}));
 }
 
-// Several callers on a working but slow modem (each answer takes 100 ms)
-// all wait their turn and get their own answers.
+// Several callers on a working but slow modem (each answer takes 100 ms, so
+// the last caller waits far longer than the silence bound) all wait their
+// turn and get their own answers.
 TEST_F(Front, ConcurrentCallersOnAWorkingModemAreAllServed) {
   se_delay::setDivisorForTest(1);
   initAndWait();
@@ -371,7 +372,7 @@ TEST_F(Front, ConcurrentCallersOnAWorkingModemAreAllServed) {
     const std::string hex = cmd.substr(cmd.find('"') + 1, 4);
     m.send(okLine("+CSIM: 6,\"" + hex.substr(2, 2) + "9000\""));
   });
-  constexpr int kCallers = 4;
+  constexpr int kCallers = 8;
   LogCapture cap;
   std::vector<std::future<std::vector<uint8_t>>> calls;
   for (int i = 0; i < kCallers; i++) {
@@ -422,19 +423,16 @@ TEST_F(Front, EachCallGoesToTheModemOfTheSwitchedSim) {
   EXPECT_EQ(3u, modem0_->commands().size());
 }
 
-TEST(FrontClass, ConstructorBasicChannelAndDeath) {
+// The log lines of these are in LogLinesHaveTheirPriorityAndBuffer.
+TEST(FrontClass, ConstructorAndBasicChannel) {
   struct Case {
     int given, kept;
   };
   for (const Case& c : {Case{0, 0}, Case{1, 1}, Case{5, 0}, Case{-1, 0}}) {
-    LogCapture cap;
-    sp<ZerbSimSecureElement> se = sp<ZerbSimSecureElement>::make(c.given);
-    EXPECT_EQ(c.kept, se->modemId());
-    EXPECT_TRUE(cap.contains("ZerbSimSecureElement, modemid " + std::to_string(c.given), kTag));
+    EXPECT_EQ(c.kept, sp<ZerbSimSecureElement>::make(c.given)->modemId()) << c.given;
   }
   // Refused before any init, without touching a modem.
   sp<ZerbSimSecureElement> se = sp<ZerbSimSecureElement>::make(1);
-  LogCapture cap;
   int calls = 0;
   se->openBasicChannel({0xA0, 0x00}, 0x00, [&](const hidl_vec<uint8_t>& resp, SecureElementStatus s) {
     EXPECT_EQ(0u, resp.size());
@@ -442,10 +440,6 @@ TEST(FrontClass, ConstructorBasicChannelAndDeath) {
     calls++;
   });
   EXPECT_EQ(1, calls);
-  EXPECT_TRUE(cap.contains("openBasicChannel, not allowed open basic channel", kTag));
-  se->serviceDied(0, nullptr);
-  EXPECT_TRUE(cap.contains("serviceDied, enter, modem_id: 1", kTag));
-  EXPECT_EQ(2u, cap.records().size());
 }
 
 }  // namespace
