@@ -5,11 +5,13 @@
 
 #include <android/log.h>
 #include <errno.h>
+#include <fcntl.h>
 #include <poll.h>
 #include <securec.h>
 #include <sys/eventfd.h>
 #include <unistd.h>
 
+#include <atomic>
 #include <cstdlib>
 #include <cstring>
 #include <ctime>
@@ -34,6 +36,8 @@ constexpr uint64_t kWriteRetryMicros = 1000000ULL;
 // Pause after a zero-byte read before the port is read again.
 constexpr uint64_t kEofRetryMicros = 1000000ULL;
 constexpr int32_t kWriteAttempts = 5;
+// How long at_close waits for the port's reader to leave.
+constexpr time_t kReaderLeaveSeconds = 1;
 constexpr int32_t kModemSlots = 2;
 
 pthread_key_t ac_key;
@@ -43,6 +47,22 @@ bool g_keyMade = false;  // written only inside the once-control
 pthread_attr_t reader_thread_attrs[kModemSlots];
 bool g_attrInited[kModemSlots];
 pthread_mutex_t g_attrLock = PTHREAD_MUTEX_INITIALIZER;
+
+// Every context ever made (see AtContext::next_made).
+pthread_mutex_t g_registryLock = PTHREAD_MUTEX_INITIALIZER;
+AtContext* g_madeContexts = nullptr;
+
+// Per modem slot: when the pending command started (monotonic microseconds,
+// 0 while none is pending) and when a line of its answer last came. Written
+// by the port's worker and reader, read by any thread.
+std::atomic<int64_t> g_pendingSince[kModemSlots];
+std::atomic<int64_t> g_lastAnswer[kModemSlots];
+
+int64_t monotonicMicros() {
+  struct timespec now;
+  clock_gettime(CLOCK_MONOTONIC, &now);
+  return static_cast<int64_t>(now.tv_sec) * 1000000 + now.tv_nsec / 1000;
+}
 
 // The context this thread reads for, when it is a reader thread.
 thread_local AtContext* t_readerOf = nullptr;
@@ -120,6 +140,7 @@ AtContext* InitializeAtContext(int32_t fd, int32_t index) {
     AtContext* ac = fresh.get();
     ac->index = index;
     ac->fd = -1;  // at_open sets the port once any earlier reader is gone
+    ac->reader_fd = -1;
     at_line_reset(ac->line_buf, &ac->line_cur, &ac->read_end);
     pthread_mutex_init(&ac->command_lock, nullptr);
     pthread_mutex_init(&ac->request_lock, nullptr);
@@ -144,7 +165,9 @@ AtContext* InitializeAtContext(int32_t fd, int32_t index) {
     }
     // Bound to the thread from now on; the record lives until the process
     // ends, since a detached reader may still hold it after at_close.
-    (void)fresh.release();
+    MutexGuard registry(&g_registryLock);
+    ac->next_made = g_madeContexts;
+    g_madeContexts = fresh.release();
   }
   AtContext* ac = getAtContext();
   if (ac == nullptr) AT_LOGE("getAtContext return null pointer!");
@@ -210,6 +233,8 @@ void readerGone(AtContext* ac) {
   }
   AT_LOGI("[m%d][ch:%d] < reader close.\n", ac->index, currentFd(ac));
   MutexGuard g(&ac->port_lock);
+  if (ac->reader_fd >= 0) close(ac->reader_fd);
+  ac->reader_fd = -1;
   ac->reader_running = 0;
   pthread_cond_broadcast(&ac->reader_gone_cond);
   // The record must not be touched after this point: a new at_open may
@@ -235,11 +260,13 @@ void processLine(AtContext* ac, const char* line) {
   switch (kind) {
     case AT_KIND_FINAL_SUCCESS:
     case AT_KIND_FINAL_ERROR:
+      g_lastAnswer[ac->index] = monotonicMicros();
       r->success = kind == AT_KIND_FINAL_SUCCESS ? 1 : 0;
       r->final_response = strdup(line);
       pthread_cond_signal(&ac->command_cond);
       break;
     case AT_KIND_INTERMEDIATE: {
+      g_lastAnswer[ac->index] = monotonicMicros();
       auto* node = static_cast<ATResponseLine*>(calloc(1, sizeof(ATResponseLine)));
       char* text = strdup(line);
       if (node == nullptr || text == nullptr) {
@@ -260,7 +287,7 @@ void processLine(AtContext* ac, const char* line) {
 
 int32_t readPort(void* arg, char* dest, int32_t max_len) {
   auto* ac = static_cast<AtContext*>(arg);
-  int32_t n = sync_read(currentFd(ac), dest, max_len);
+  int32_t n = sync_read(ac->reader_fd, dest, max_len);
   if (n > 0) ac->eof_count = 0;
   return n;
 }
@@ -296,8 +323,20 @@ void reverseIntermediates(ATResponse* r) {
   r->p_intermediates = prev;
 }
 
-// One write attempt: 0 written, -3 channel closed, -1 failed.
-int32_t writeAttempt(const char* s, size_t len) {
+// Milliseconds from now until `deadline` (monotonic), 0 once it has passed.
+int msUntil(const struct timespec* deadline) {
+  struct timespec now;
+  clock_gettime(CLOCK_MONOTONIC, &now);
+  int64_t ms = (static_cast<int64_t>(deadline->tv_sec) - now.tv_sec) * 1000 +
+               (deadline->tv_nsec - now.tv_nsec) / 1000000;
+  if (ms <= 0) return 0;
+  return ms > INT32_MAX ? INT32_MAX : static_cast<int>(ms);
+}
+
+// One write attempt: 0 written, -3 channel closed, -4 the port took no
+// bytes until the deadline, -1 failed. The port is non-blocking: a modem
+// that stops reading must not hold command_lock past the deadline.
+int32_t writeAttempt(const char* s, size_t len, const struct timespec* deadline) {
   AtContext* ac = getAtContext();
   if (ac == nullptr) {
     AT_LOGE("getAtContext return null pointer!");
@@ -324,6 +363,16 @@ int32_t writeAttempt(const char* s, size_t len) {
   while (done < len + 1) {
     ssize_t n = write(ac->fd, buf.get() + done, len + 1 - done);
     if (n < 0 && errno == EINTR) continue;
+    if (n < 0 && (errno == EAGAIN || errno == EWOULDBLOCK)) {
+      struct pollfd pfd = {ac->fd, POLLOUT, 0};
+      int rc = poll(&pfd, 1, msUntil(deadline));
+      if (rc == 0) {
+        AT_LOGE("m%d_%d>write timed out", ac->index, ac->fd);
+        return AT_ERROR_TIMEOUT;
+      }
+      if (rc < 0 && errno != EINTR) return -1;
+      continue;
+    }
     if (n <= 0) return -1;
     done += static_cast<size_t>(n);
   }
@@ -336,14 +385,16 @@ int32_t exchange(AtContext* ac, const char* command, int32_t type, const char* p
                  ATResponse** out) {
   if (ac->response != nullptr) return AT_ERROR_COMMAND_PENDING;
   ac->command_type = type;
-  int32_t err = writeline(command);
+  // The write and the wait for the answer share one deadline.
+  struct timespec deadline = deadlineAfter(se_delay::scaledMicros(kCommandTimeoutMicros));
+  g_pendingSince[ac->index] = monotonicMicros();
+  int32_t err = writeline(command, &deadline);
   if (err < 0) return err;
 
   ac->response_prefix = prefix;
   ac->response = static_cast<ATResponse*>(calloc(1, sizeof(ATResponse)));
   if (ac->response == nullptr) return AT_ERROR_GENERIC;
 
-  struct timespec deadline = deadlineAfter(se_delay::scaledMicros(kCommandTimeoutMicros));
   while (ac->response->final_response == nullptr && ac->reader_closed == 0) {
     int rc = pthread_cond_timedwait(&ac->command_cond, &ac->command_lock, &deadline);
     if (rc == ETIMEDOUT) {
@@ -395,11 +446,23 @@ int32_t at_open(int32_t fd, AtUnsolHandler h, int32_t index) {
   }
   retirePreviousReader(ac);
 
+  int32_t readerFd = -1;
+  if (fd >= 0) {
+    int flags = fcntl(fd, F_GETFL);
+    if (flags >= 0) (void)fcntl(fd, F_SETFL, flags | O_NONBLOCK);
+    readerFd = fcntl(fd, F_DUPFD_CLOEXEC, 0);
+    if (readerFd < 0) {
+      AT_LOGE("m%d_%d>ReaderLoop create error!", index, fd);
+      close(fd);
+      return -1;
+    }
+  }
   {
     MutexGuard command(&ac->command_lock);
     MutexGuard port(&ac->port_lock);
     ac->index = index;
     ac->fd = fd;
+    ac->reader_fd = readerFd;
   }
   AT_LOGD("at_open = ac->fd=%d,ac->index=%d", fd, index);
   ac->unsol_handler = h;
@@ -425,7 +488,11 @@ int32_t at_open(int32_t fd, AtUnsolHandler h, int32_t index) {
     MutexGuard port(&ac->port_lock);
     ac->reader_running = 1;
     rc = pthread_create(&ac->reader_thread, &reader_thread_attrs[index], readerMain, ac);
-    if (rc != 0) ac->reader_running = 0;
+    if (rc != 0) {
+      ac->reader_running = 0;
+      if (ac->reader_fd >= 0) close(ac->reader_fd);
+      ac->reader_fd = -1;
+    }
   }
   if (rc != 0) {
     AT_LOGE("m%d_%d>ReaderLoop create error!", index, fd);
@@ -446,10 +513,28 @@ void at_close(void) {
   AT_LOGI("m%d_%d>at close.", static_cast<int32_t>(g_ulModemId), ac->index);
   // request_lock stays: a command issued after the close still takes it and
   // must find a valid mutex (it then ends with -3).
-  MutexGuard attrs(&g_attrLock);
-  if (g_attrInited[ac->index]) {
-    pthread_attr_destroy(&reader_thread_attrs[ac->index]);
-    g_attrInited[ac->index] = false;
+  {
+    MutexGuard attrs(&g_attrLock);
+    if (g_attrInited[ac->index]) {
+      pthread_attr_destroy(&reader_thread_attrs[ac->index]);
+      g_attrInited[ac->index] = false;
+    }
+  }
+  // The reader was woken above and leaves at once; waiting for it means a
+  // closed port has no thread left reading or logging for it. The wait is
+  // bounded, so that a driver whose read blocks cannot stall the close; the
+  // reader itself (closing from its handler) cannot wait for its own end.
+  if (t_readerOf != ac) {
+    struct timespec deadline;
+    clock_gettime(CLOCK_REALTIME, &deadline);
+    deadline.tv_sec += kReaderLeaveSeconds;
+    MutexGuard g(&ac->port_lock);
+    while (ac->reader_running != 0) {
+      if (pthread_cond_timedwait(&ac->reader_gone_cond, &ac->port_lock, &deadline) == ETIMEDOUT) {
+        AT_LOGE("m%d_%d>reader still busy after close", static_cast<int32_t>(g_ulModemId), ac->index);
+        break;
+      }
+    }
   }
 }
 
@@ -553,9 +638,8 @@ int32_t sync_read(int32_t fd, char* dest, int32_t max_len) {
     bool portReady = (pfd[0].revents & (POLLIN | POLLHUP | POLLERR)) != 0;
     bool woken = (pfd[1].revents & POLLIN) != 0;
 
-    MutexGuard g(&ac->port_lock);
-    if (ac->fd != fd) {
-      // Closed while we waited: the number may belong to someone else now.
+    if (currentFd(ac) < 0) {
+      // Closed while we waited.
       AT_LOGE("Read FD is invalid\n");
       errno = EBADF;
       return -1;
@@ -569,10 +653,13 @@ int32_t sync_read(int32_t fd, char* dest, int32_t max_len) {
       errno = EBADF;
       return -1;
     }
+    // `fd` is the reader's own duplicate, so no lock is held across the
+    // read: a driver whose read blocks cannot stall get_ac_index or at_close.
     ssize_t n;
     do {
       n = read(fd, dest, static_cast<size_t>(max_len));
     } while (n < 0 && errno == EINTR);
+    if (n < 0 && (errno == EAGAIN || errno == EWOULDBLOCK)) continue;  // nothing after all
     if (n < 0) {
       int saved = errno;
       AT_LOGE("Read error \n");
@@ -585,12 +672,12 @@ int32_t sync_read(int32_t fd, char* dest, int32_t max_len) {
 
 // ---- sender ------------------------------------------------------------------
 
-int32_t writeline(const char* s) {
+int32_t writeline(const char* s, const struct timespec* deadline) {
   size_t len = strlen(s);
   for (int32_t attempt = 0; attempt < kWriteAttempts; ++attempt) {
-    int32_t rc = writeAttempt(s, len);
+    int32_t rc = writeAttempt(s, len, deadline);
     if (rc == 0) return AT_OK;
-    if (rc == AT_ERROR_CHANNEL_CLOSED) return AT_ERROR_CHANNEL_CLOSED;
+    if (rc == AT_ERROR_CHANNEL_CLOSED || rc == AT_ERROR_TIMEOUT) return rc;
     AT_LOGE("writeline error,errno:%d", -1);
     se_delay::sleepMicros(kWriteRetryMicros);
   }
@@ -610,6 +697,7 @@ int32_t at_send_command_full_nolock(const char* command, int32_t type, const cha
     pthread_cond_wait(&ac->request_cond, &ac->command_lock);
   }
   int32_t err = exchange(ac, command, type, responsePrefix, pp_outResponse);
+  g_pendingSince[ac->index] = 0;
   if (ac->response != nullptr) {
     at_response_free(ac->response);
     ac->response = nullptr;
@@ -657,9 +745,11 @@ int32_t at_send_command(const char* command, ATResponse** pp_outResponse) {
   return at_send_command_full(command, at_type_none, nullptr, pp_outResponse);
 }
 
-int32_t at_send_command_singleline(const char* command, const char* responsePrefix,
-                                   ATResponse** pp_outResponse) {
-  int32_t err = at_send_command_full(command, at_type_singleline, responsePrefix, pp_outResponse);
+namespace {
+
+int32_t sendSingleline(const char* command, int32_t type, const char* responsePrefix,
+                       ATResponse** pp_outResponse) {
+  int32_t err = at_send_command_full(command, type, responsePrefix, pp_outResponse);
   if (pp_outResponse != nullptr && err == AT_OK && *pp_outResponse != nullptr &&
       (*pp_outResponse)->success > 0 && (*pp_outResponse)->p_intermediates == nullptr) {
     at_response_free(*pp_outResponse);
@@ -667,6 +757,18 @@ int32_t at_send_command_singleline(const char* command, const char* responsePref
     return AT_ERROR_INVALID_RESPONSE;
   }
   return err;
+}
+
+}  // namespace
+
+int32_t at_send_command_singleline(const char* command, const char* responsePrefix,
+                                   ATResponse** pp_outResponse) {
+  return sendSingleline(command, at_type_singleline, responsePrefix, pp_outResponse);
+}
+
+int32_t at_send_command_singleline_or_numeric(const char* command, const char* responsePrefix,
+                                              ATResponse** pp_outResponse) {
+  return sendSingleline(command, at_type_singleline_or_numeric, responsePrefix, pp_outResponse);
 }
 
 void at_set_on_timeout(AtTimeoutCallback onTimeout) {
@@ -678,3 +780,20 @@ void at_set_on_timeout(AtTimeoutCallback onTimeout) {
   ac->on_timeout = onTimeout;
 }
 
+
+int32_t at_is_closed(void) {
+  if (!keyReady()) return 1;
+  auto* ac = static_cast<AtContext*>(pthread_getspecific(ac_key));
+  if (ac == nullptr) return 1;
+  MutexGuard g(&ac->command_lock);
+  return ac->reader_closed > 0 ? 1 : 0;
+}
+
+int64_t at_silence_micros(int32_t index) {
+  if (index < 0 || index >= kModemSlots) return 0;
+  int64_t since = g_pendingSince[index];
+  if (since == 0) return 0;
+  int64_t last = g_lastAnswer[index];
+  int64_t silent = monotonicMicros() - (last > since ? last : since);
+  return silent > 0 ? silent : 0;
+}

@@ -4,6 +4,7 @@
 #include <pthread.h>
 
 #include <cstdint>
+#include <ctime>
 
 #include "at_line.h"
 #include "atchannel.h"
@@ -38,6 +39,13 @@ struct AtContext {
   int32_t wake_fd;
   // Reader-only: zero-byte reads in a row since the last data.
   int32_t eof_count;
+  // The reader's own descriptor of the port (a duplicate of `fd`), so that
+  // it reads without port_lock: closing `fd` can never hand its number to
+  // someone else under a read. Closed by the reader when it ends.
+  int32_t reader_fd;
+  // Every context ever made, so that records outliving their threads stay
+  // reachable (they are never freed). Guarded by the registry's lock.
+  AtContext* next_made;
 };
 
 void* readerLoop(AtContext* ac);
@@ -48,4 +56,6 @@ int32_t at_send_command_full(const char* command, int32_t type, const char* resp
                              ATResponse** pp_outResponse);
 int32_t at_send_command_full_nolock(const char* command, int32_t type,
                                     const char* responsePrefix, ATResponse** pp_outResponse);
-int32_t writeline(const char* s);
+// Writes the command and its CR, giving up when `deadline` (monotonic)
+// passes with the port still not taking the bytes.
+int32_t writeline(const char* s, const struct timespec* deadline);

@@ -12,7 +12,21 @@
 //   vendor.ese_sim.channels      channels of the card, basic included (1 to 20,
 //                                default 4), taken when the eSE is opened from
 //                                the closed state
+//   vendor.ese_sim.min_channel   the lowest channel number MANAGE CHANNEL open
+//                                assigns (default 1); 4 or more hands out
+//                                channels the daemon cannot serve (with
+//                                vendor.ese_sim.channels above 4)
+//   vendor.ese_sim.hang_exchange 1: both exchanges hang, holding the library's
+//                                lock (so open and close wait too), until the
+//                                property is cleared; "hanging" and "released"
+//                                are logged
 // Flags take 1, true, yes or on.
+//
+// Open channels report: whenever the set of the card's open logical channels
+// changes, the library rewrites $SE_DEVICE_ROOT/data/vendor/ese_sim/open_channels
+// with one line, the open channel numbers in ascending order separated by
+// blanks, the basic channel not listed (an empty line: none open), and logs
+// "open channels: ...".
 //
 // The eSE is closed when the library loads. Exchanges fail (-1, no bytes)
 // until phQvEse_init_open succeeds and again after phQvEse_close, which also
@@ -27,6 +41,11 @@
 
 #include <android/log.h>
 #include <cutils/properties.h>
+
+#include <host/device_root.h>
+#include <stdio.h>
+#include <sys/stat.h>
+#include <time.h>
 
 #include <cctype>
 #include <cerrno>
@@ -113,6 +132,9 @@ struct Ese {
   bool opened = false;
   int channels = kDefaultChannels;
   se_card::VirtualCard card{se_card::CardOptions{kDefaultChannels, {}}};
+  // The open channel line last written, and where (tests change the root).
+  std::string reported;
+  std::string reportedTo;
 };
 
 // Lives as long as the process: a daemon thread may still call in while the
@@ -122,8 +144,78 @@ Ese& ese() {
   return *instance;
 }
 
+std::string reportDir() { return android::host::mapDevicePath("/data/vendor/ese_sim"); }
+
+// Folders on the way are made as needed; the file is replaced whole, so that
+// a reader never sees half a line.
+void writeReport(const std::string& dir, const std::string& line) {
+  std::string made;
+  for (size_t at = 0; at != std::string::npos;) {
+    at = dir.find('/', at + 1);
+    made = dir.substr(0, at);
+    if (!made.empty()) mkdir(made.c_str(), 0755);
+  }
+  const std::string path = dir + "/open_channels";
+  const std::string tmp = path + ".new";
+  FILE* f = fopen(tmp.c_str(), "w");
+  if (f == nullptr) {
+    __android_log_print(ANDROID_LOG_ERROR, kTag, "cannot write %s: %s", tmp.c_str(), strerror(errno));
+    return;
+  }
+  fprintf(f, "%s\n", line.c_str());
+  fclose(f);
+  rename(tmp.c_str(), path.c_str());
+}
+
+// Called with the lock held after anything that may open or close channels.
+void reportOpenChannels(Ese& e) {
+  std::string line;
+  for (int c = 1; c < e.card.channelCount(); ++c) {
+    if (!e.card.isChannelOpen(c)) continue;
+    if (!line.empty()) line += ' ';
+    line += std::to_string(c);
+  }
+  const std::string dir = reportDir();
+  if (line == e.reported && dir == e.reportedTo) return;
+  e.reported = line;
+  e.reportedTo = dir;
+  __android_log_print(ANDROID_LOG_INFO, kTag, "open channels: %s", line.c_str());
+  writeReport(dir, line);
+}
+
+// MANAGE CHANNEL open with the card choosing (P2 00): assigns the lowest free
+// channel from vendor.ese_sim.min_channel on by opening it by number.
+bool isAssigningOpen(const std::vector<uint8_t>& apdu) {
+  return apdu.size() >= 4 && apdu[1] == 0x70 && apdu[2] == 0x00 && apdu[3] == 0x00;
+}
+
+std::vector<uint8_t> openFrom(Ese& e, const std::vector<uint8_t>& apdu, int first) {
+  for (int c = first; c < e.card.channelCount(); ++c) {
+    if (e.card.isChannelOpen(c)) continue;
+    std::vector<uint8_t> byNumber = {apdu[0], 0x70, 0x00, static_cast<uint8_t>(c)};
+    std::vector<uint8_t> r = e.card.process(byNumber);
+    if (statusOf(r) != se_card::SW_OK) return r;
+    return {static_cast<uint8_t>(c), 0x90, 0x00};
+  }
+  return {0x6A, 0x81};
+}
+
+// While vendor.ese_sim.hang_exchange is set, the call does not return; the
+// property is looked at again every 20 ms.
+void hangWhileAsked(const char* fn) {
+  if (!propertyFlag("vendor.ese_sim.hang_exchange")) return;
+  __android_log_print(ANDROID_LOG_ERROR, kTag, "%s: hanging (vendor.ese_sim.hang_exchange)", fn);
+  while (propertyFlag("vendor.ese_sim.hang_exchange")) {
+    struct timespec ts = {0, 20 * 1000000L};
+    nanosleep(&ts, nullptr);
+  }
+  __android_log_print(ANDROID_LOG_ERROR, kTag, "%s: released", fn);
+}
+
 std::vector<uint8_t> exchange(Ese& e, const std::vector<uint8_t>& apdu, const char* route) {
-  std::vector<uint8_t> r = e.card.process(apdu);
+  const int first = isAssigningOpen(apdu) ? propertyInt("vendor.ese_sim.min_channel", 1) : 1;
+  std::vector<uint8_t> r = first > 1 ? openFrom(e, apdu, first) : e.card.process(apdu);
+  reportOpenChannels(e);
   __android_log_print(ANDROID_LOG_DEBUG, kTag, "%s > %s", route, hex(apdu.data(), apdu.size()).c_str());
   __android_log_print(ANDROID_LOG_DEBUG, kTag, "%s < %s (%s)", route, hex(r.data(), r.size()).c_str(),
                       se_card::statusWordName(statusOf(r)).c_str());
@@ -154,6 +246,7 @@ extern "C" int32_t phQvEse_init_open(void) {
     }
     e.opened = true;
   }
+  reportOpenChannels(e);
   __android_log_print(ANDROID_LOG_INFO, kTag, "phQvEse_init_open: open, %d channels, type %d", e.channels,
                       g_korva_exist);
   return 0;
@@ -164,6 +257,7 @@ extern "C" int32_t phQvEse_close(void) {
   std::lock_guard<std::mutex> guard(e.lock);
   e.opened = false;
   e.card.reset();
+  reportOpenChannels(e);
   __android_log_print(ANDROID_LOG_INFO, kTag, "phQvEse_close: closed, card reset");
   return 0;
 }
@@ -175,6 +269,7 @@ extern "C" int32_t phQvEse_7816_Transceive(phQvEse_7816_cpdu* cpdu, phQvEse_7816
   }
   Ese& e = ese();
   std::lock_guard<std::mutex> guard(e.lock);
+  hangWhileAsked("phQvEse_7816_Transceive");
   rpdu->len = 0;
   const ExchangeFault fault = exchangeFault();
   rpdu->sw1 = static_cast<uint8_t>(fault.sw >> 8);
@@ -219,6 +314,7 @@ extern "C" int32_t phQVNciHal_Transmit_APDU_by_IPC(phQvEse_data* cmd, phQvEse_da
   }
   Ese& e = ese();
   std::lock_guard<std::mutex> guard(e.lock);
+  hangWhileAsked("phQVNciHal_Transmit_APDU_by_IPC");
   rsp->len = 0;
   const ExchangeFault fault = exchangeFault();
   if (fault.fail) {

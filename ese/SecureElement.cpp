@@ -9,6 +9,7 @@
 #include <securec.h>
 
 #include "ese_buffer.h"
+#include "ese_library.h"
 #include "ese_qv_hal.h"
 
 namespace android {
@@ -58,15 +59,24 @@ Buffer allocBuffer(size_t size, bool zeroFill) {
   return Buffer(eseBufferAlloc(size == 0 ? 1 : size, zeroFill));
 }
 
+namespace lib = ese_library;
+
+// Holds the front's lock for one operation, unless the caller gave up because
+// the holder is stuck in the library; the operation then fails as it does
+// when the library fails.
 class EseLock {
  public:
-  explicit EseLock(pthread_mutex_t* m) : m_(m) { pthread_mutex_lock(m_); }
-  ~EseLock() { pthread_mutex_unlock(m_); }
+  EseLock(pthread_mutex_t* m, const char* op) : m_(m), held_(lib::lockFront(m, op)) {}
+  ~EseLock() {
+    if (held_) pthread_mutex_unlock(m_);
+  }
   EseLock(const EseLock&) = delete;
   EseLock& operator=(const EseLock&) = delete;
+  bool held() const { return held_; }
 
  private:
   pthread_mutex_t* m_;
+  bool held_;
 };
 
 bool isTracked(uint8_t channel) { return channel < kTrackedChannels; }
@@ -101,7 +111,7 @@ int32_t transmitByIpc(uint8_t* cmdBuf, size_t cmdLen, uint8_t* rspBuf, size_t* r
   cmdApdu.p_data = cmdBuf;
   rspApdu.len = 0;
   rspApdu.p_data = rspBuf;
-  const int32_t rc = phQVNciHal_Transmit_APDU_by_IPC(&cmdApdu, &rspApdu);
+  const int32_t rc = lib::transmitByIpc(&cmdApdu, &rspApdu);
   *rspLen = boundedLen(rspApdu, kRspBufSize);
   return rc;
 }
@@ -132,7 +142,7 @@ SecureElementStatus mapManageOpenSw(uint8_t sw1, uint8_t sw2) {
   return SecureElementStatus::FAILED;
 }
 
-void powerOff() { phQVNciHal_Set_KORVA_Power(kPowerOff); }
+void powerOff() { (void)lib::setPower(kPowerOff); }
 
 // A SELECT by DF name on `cla`'s channel, the AID copied into `aidBuf`.
 void fillSelect(phQvEse_7816_cpdu* cpdu, phQvEse_7816_rpdu* rpdu, uint8_t cla, uint8_t p2,
@@ -162,6 +172,34 @@ void failedSelectClose(const char* op, uint8_t channel) {
   }
 }
 
+// MANAGE CHANNEL close of `channel`, sent on the channel named by `cla`;
+// SUCCESS when the card answers 90 00.
+SecureElementStatus manageClose(uint8_t cla, uint8_t channel, const char* op) {
+  Buffer rsp = allocBuffer(kRspBufSize, true);
+  if (!rsp) {
+    __android_log_print(ANDROID_LOG_ERROR, kTag, "%s rpdu.pdata malloc fail!", op);
+    return SecureElementStatus::FAILED;
+  }
+  phQvEse_7816_cpdu cpdu;
+  phQvEse_7816_rpdu rpdu;
+  memset_s(&cpdu, sizeof(cpdu), 0, sizeof(cpdu));
+  memset_s(&rpdu, sizeof(rpdu), 0, sizeof(rpdu));
+  cpdu.cla = cla;
+  cpdu.ins = kInsManageChannel;
+  cpdu.p1 = 0x80;
+  cpdu.p2 = channel;
+  cpdu.lc = 0;
+  cpdu.pdata = nullptr;
+  cpdu.le_type = 0;
+  cpdu.le = 0x9000;
+  rpdu.pdata = rsp.get();
+  rpdu.len = 0;
+  if (lib::transceive(&cpdu, &rpdu) == 0 && rpdu.sw1 == 0x90 && rpdu.sw2 == 0x00) {
+    return SecureElementStatus::SUCCESS;
+  }
+  return SecureElementStatus::FAILED;
+}
+
 // The close shared by closeChannel and internalCloseChannel; `op` names the
 // caller in the log.
 SecureElementStatus closeChannelUnlocked(uint8_t channel, const char* op) {
@@ -171,30 +209,7 @@ SecureElementStatus closeChannelUnlocked(uint8_t channel, const char* op) {
   // Channel 0 is the basic channel, never closed. Above 3 the CLA would not be
   // the channel number, so a close built from it would hit another channel;
   // this front never hands such a channel out, so there is nothing to close.
-  if (channel != 0 && isTracked(channel)) {
-    Buffer rsp = allocBuffer(kRspBufSize, true);
-    if (!rsp) {
-      __android_log_print(ANDROID_LOG_ERROR, kTag, "%s rpdu.pdata malloc fail!", op);
-    } else {
-      phQvEse_7816_cpdu cpdu;
-      phQvEse_7816_rpdu rpdu;
-      memset_s(&cpdu, sizeof(cpdu), 0, sizeof(cpdu));
-      memset_s(&rpdu, sizeof(rpdu), 0, sizeof(rpdu));
-      cpdu.cla = channel;
-      cpdu.ins = kInsManageChannel;
-      cpdu.p1 = 0x80;
-      cpdu.p2 = channel;
-      cpdu.lc = 0;
-      cpdu.pdata = nullptr;
-      cpdu.le_type = 0;
-      cpdu.le = 0x9000;
-      rpdu.pdata = rsp.get();
-      rpdu.len = 0;
-      if (phQvEse_7816_Transceive(&cpdu, &rpdu) == 0 && rpdu.sw1 == 0x90 && rpdu.sw2 == 0x00) {
-        status = SecureElementStatus::SUCCESS;
-      }
-    }
-  }
+  if (channel != 0 && isTracked(channel)) status = manageClose(channel, channel, op);
   powerOff();
   return status;
 }
@@ -224,13 +239,13 @@ Return<void> SecureElement::init(const sp<ISecureElementHalCallback>& clientCall
 
   // Channels left open by a client that went away are closed once the eSE
   // says it is ready; channel 0 is the basic channel and never closed.
-  if (phQVNciHal_Get_KORVA_Ready_Status() == 0) {
+  if (lib::readyStatus() == 0) {
     for (uint8_t c = 1; c < kTrackedChannels; ++c) {
       if (g_openedChannels[c].load() == 1) internalCloseChannel(c);
     }
   }
 
-  if (phQvEse_init_open() == 0) {
+  if (lib::initOpen() == 0) {
     clientCallback->onStateChange(true);
   } else {
     __android_log_print(ANDROID_LOG_ERROR, kTag, "phQvEse_init_open FAIL");
@@ -251,7 +266,11 @@ Return<bool> SecureElement::isCardPresent() {
 
 Return<void> SecureElement::transmit(const hidl_vec<uint8_t>& data, transmit_cb _hidl_cb) {
   static const char* const kOp = "transmit";
-  EseLock lock(g_eseMutex.get());
+  EseLock lock(g_eseMutex.get(), kOp);
+  if (!lock.held()) {
+    _hidl_cb(hidl_vec<uint8_t>{kMarkerTransmitFailed});
+    return Void();
+  }
   __android_log_print(ANDROID_LOG_INFO, kTag, "%s enter!", kOp);
 
   std::vector<uint8_t> cmd(data.begin(), data.end());
@@ -297,7 +316,13 @@ Return<void> SecureElement::transmit(const hidl_vec<uint8_t>& data, transmit_cb 
 Return<void> SecureElement::openLogicalChannel(const hidl_vec<uint8_t>& aid, uint8_t p2,
                                                openLogicalChannel_cb _hidl_cb) {
   static const char* const kOp = "openLogicalChannel";
-  EseLock lock(g_eseMutex.get());
+  EseLock lock(g_eseMutex.get(), kOp);
+  if (!lock.held()) {
+    LogicalChannelResponse failed;
+    failed.channelNumber = kMarkerExchangeFailed;
+    _hidl_cb(failed, SecureElementStatus::FAILED);
+    return Void();
+  }
   __android_log_print(ANDROID_LOG_INFO, kTag, "%s enter!", kOp);
 
   LogicalChannelResponse result;
@@ -326,7 +351,7 @@ Return<void> SecureElement::openLogicalChannel(const hidl_vec<uint8_t>& aid, uin
     return Void();
   }
 
-  if (phQVNciHal_Set_KORVA_READY() != 0) {
+  if (lib::setReady() != 0) {
     __android_log_print(ANDROID_LOG_ERROR, kTag, "phQVNciHal_Set_KORVA_READY failed!!!");
     deliverUnassigned(kMarkerNotReady, SecureElementStatus::IOERROR);
     return Void();
@@ -366,9 +391,15 @@ Return<void> SecureElement::openLogicalChannel(const hidl_vec<uint8_t>& aid, uin
   }
   const uint8_t channel = manageBytes[0];
   // Only channels 0..3 are coded by their number in CLA and fit the table; a
-  // higher one could be neither selected nor closed correctly, so it is
-  // refused, and the power-off that follows releases it on the card.
+  // higher one is refused. It is closed on the card first, from the basic
+  // channel with P2 naming it: left open, each refused open would use up one
+  // more of the card's channels.
   if (!isTracked(channel)) {
+    __android_log_print(ANDROID_LOG_ERROR, kTag, "%s card assigned channel %d, closing it", kOp,
+                        channel);
+    if (manageClose(0x00, channel, kOp) != SecureElementStatus::SUCCESS) {
+      __android_log_print(ANDROID_LOG_ERROR, kTag, "%s close of channel %d failed", kOp, channel);
+    }
     deliverUnassigned(kNoChannel, SecureElementStatus::CHANNEL_NOT_AVAILABLE);
     return Void();
   }
@@ -394,7 +425,7 @@ Return<void> SecureElement::openLogicalChannel(const hidl_vec<uint8_t>& aid, uin
   fillSelect(&cpdu, &rpdu, channel, p2 == 0x7F ? 0x00 : p2, aid, aidBuf.get(), selectRsp.get());
 
   SecureElementStatus status = SecureElementStatus::FAILED;
-  if (phQvEse_7816_Transceive(&cpdu, &rpdu) == 0) {
+  if (lib::transceive(&cpdu, &rpdu) == 0) {
     result.selectResponse = dataAndSw(rpdu, kRspBufSize);
     __android_log_print(ANDROID_LOG_ERROR, kTag,
                         "%s OpenLogicalChannel Select AID response value 0x%x%x", kOp, rpdu.sw1,
@@ -441,7 +472,11 @@ Return<void> SecureElement::openBasicChannel(const hidl_vec<uint8_t>& aid, uint8
                                              openBasicChannel_cb _hidl_cb) {
   static const char* const kOp = "openBasicChannel";
   __android_log_print(ANDROID_LOG_INFO, kTag, "%s enter!", kOp);
-  EseLock lock(g_eseMutex.get());
+  EseLock lock(g_eseMutex.get(), kOp);
+  if (!lock.held()) {
+    _hidl_cb(hidl_vec<uint8_t>{kMarkerExchangeFailed}, SecureElementStatus::FAILED);
+    return Void();
+  }
 
   hidl_vec<uint8_t> response;
   Buffer aidBuf = allocBuffer(aid.size(), true);
@@ -457,7 +492,7 @@ Return<void> SecureElement::openBasicChannel(const hidl_vec<uint8_t>& aid, uint8
     return Void();
   }
 
-  if (phQVNciHal_Set_KORVA_READY() != 0) {
+  if (lib::setReady() != 0) {
     __android_log_print(ANDROID_LOG_ERROR, kTag, "phQVNciHal_Set_KORVA_READY failed!!!");
     _hidl_cb(hidl_vec<uint8_t>{kMarkerNotReady}, SecureElementStatus::IOERROR);
     powerOff();
@@ -469,7 +504,7 @@ Return<void> SecureElement::openBasicChannel(const hidl_vec<uint8_t>& aid, uint8
   fillSelect(&cpdu, &rpdu, 0x00, p2, aid, aidBuf.get(), selectRsp.get());
 
   SecureElementStatus status = SecureElementStatus::FAILED;
-  if (phQvEse_7816_Transceive(&cpdu, &rpdu) != 0) {
+  if (lib::transceive(&cpdu, &rpdu) != 0) {
     const bool swSaysNothing = (rpdu.sw1 == 0x00 || rpdu.sw1 == 0x90) && rpdu.sw2 == 0x00;
     response = swSaysNothing ? hidl_vec<uint8_t>{kMarkerExchangeFailed}
                              : hidl_vec<uint8_t>{kMarkerExchangeFailed, rpdu.sw1, rpdu.sw2};
@@ -523,8 +558,10 @@ Return<void> SecureElement::openBasicChannel(const hidl_vec<uint8_t>& aid, uint8
 }
 
 Return<SecureElementStatus> SecureElement::closeChannel(uint8_t channelNumber) {
-  EseLock lock(g_eseMutex.get());
-  return closeChannelUnlocked(channelNumber, "closeChannel");
+  static const char* const kOp = "closeChannel";
+  EseLock lock(g_eseMutex.get(), kOp);
+  if (!lock.held()) return SecureElementStatus::FAILED;
+  return closeChannelUnlocked(channelNumber, kOp);
 }
 
 SecureElementStatus SecureElement::internalCloseChannel(uint8_t channelNumber) {
@@ -533,7 +570,9 @@ SecureElementStatus SecureElement::internalCloseChannel(uint8_t channelNumber) {
 
 void SecureElement::serviceDied(uint64_t /*cookie*/, const wp<IBase>& /*who*/) {
   __android_log_print(ANDROID_LOG_ERROR, kTag, "%s enter!", "serviceDied");
-  phQvEse_close();
+  // Death notices come on a pool thread; one must not wait behind a library
+  // call that may never return.
+  lib::closeNowOrAfterCurrentCall("serviceDied");
 }
 
 }  // namespace implementation

@@ -174,13 +174,15 @@ std::vector<std::string> AtResponder::openChannel(const std::vector<uint8_t>& ai
       return cme(kCmeCardError);
   }
   sessions_[r.channel] = options_.sessionBase + r.channel;
-  return {prefix + std::to_string(sessions_[r.channel]), "OK"};
+  const std::string id = std::to_string(sessions_[r.channel]);
+  return {options_.bareOpen ? id : prefix + id, "OK"};
 }
 
 std::vector<std::string> AtResponder::exchange(const std::vector<uint8_t>& apdu, const char* prefix) {
   const std::vector<uint8_t> r = card_.process(apdu);
   const std::string hex = encodeHex(r);
-  return {prefix + std::to_string(hex.size()) + ",\"" + hex + "\"", "OK"};
+  const size_t length = options_.shortLength ? hex.size() - 2 : hex.size();
+  return {prefix + std::to_string(length) + ",\"" + hex + "\"", "OK"};
 }
 
 }  // namespace modem_sim

@@ -17,6 +17,12 @@ struct ResponderOptions {
   // Session id of channel c is sessionBase + c; with a base that is a
   // multiple of 32 the low five bits of the id give the channel.
   int sessionBase = 0x100;
+  // AT+CCHO/AT+CCHP answered in the bare form of 3GPP TS 27.007: the session
+  // id alone on its line, no "+CCHO: " prefix.
+  bool bareOpen = false;
+  // +CGLA:/+CSIM: answers whose length field counts two characters fewer
+  // than the text holds (a malformed answer, as some modems send).
+  bool shortLength = false;
 };
 
 // Error codes of "+CME ERROR:" answers.

@@ -42,6 +42,11 @@ const char kUsage[] =
     "  --atr HEX           the card's ATR (default 3B868001532D53494D + TCK)\n"
     "  --channels N        channels of the card, basic included (1-20, default 20)\n"
     "  --session-base N    session id = N + channel (default 256)\n"
+    "  --bare-open         answer AT+CCHO and AT+CCHP with the session id alone\n"
+    "                      on its line (the plain 3GPP TS 27.007 form), no\n"
+    "                      +CCHO:/+CCHP: prefix\n"
+    "  --short-length      malformed +CGLA:/+CSIM: answers: the length field\n"
+    "                      counts two characters fewer than the text holds\n"
     "  --delay MS          wait MS milliseconds before each answer\n"
     "  --split N           write answers in pieces of N bytes with short pauses\n"
     "  --unsol EVERY       before the final line of every EVERY-th answer, send an\n"
@@ -299,7 +304,7 @@ int usageError(const char* msg) {
 int main(int argc, char** argv) {
   enum {
     kRoot = 1000, kModem, kCardAbsent, kAtr, kChannels, kSessionBase, kDelay, kSplit, kUnsol, kSms, kSilent,
-    kCloseAfter, kLog, kHelp
+    kCloseAfter, kLog, kHelp, kBareOpen, kShortLength
   };
   static const struct option longOpts[] = {
       {"root", required_argument, nullptr, kRoot},
@@ -308,6 +313,8 @@ int main(int argc, char** argv) {
       {"atr", required_argument, nullptr, kAtr},
       {"channels", required_argument, nullptr, kChannels},
       {"session-base", required_argument, nullptr, kSessionBase},
+      {"bare-open", no_argument, nullptr, kBareOpen},
+      {"short-length", no_argument, nullptr, kShortLength},
       {"delay", required_argument, nullptr, kDelay},
       {"split", required_argument, nullptr, kSplit},
       {"unsol", required_argument, nullptr, kUnsol},
@@ -344,6 +351,8 @@ int main(int argc, char** argv) {
         if (!parseLong(optarg, 0, 1000000, v)) return usageError("--session-base takes 0 to 1000000");
         o.responder.sessionBase = static_cast<int>(v);
         break;
+      case kBareOpen: o.responder.bareOpen = true; break;
+      case kShortLength: o.responder.shortLength = true; break;
       case kDelay:
         if (!parseLong(optarg, 0, 3600000, o.delayMs)) return usageError("--delay takes milliseconds");
         break;

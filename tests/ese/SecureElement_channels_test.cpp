@@ -53,8 +53,6 @@ std::vector<OpenRow> openRows() {
       {"empty", 0xFF, {{0, {}}}, {}, {}, FAIL, {R, M, CB, P}},
       {"one byte", 0xFF, {{0, {0x01}}}, {}, {}, FAIL, {R, M, CB, P}},  // mended: answered
       {"9000 without channel", 0xFF, {{0, {0x90, 0x00}}}, {}, {0x90, 0x00}, FAIL, {R, M, CB, P}},
-      // Mended: a channel the CLA and the table cannot hold is refused.
-      {"channel 4", 0xFF, {{0, {4, 0x90, 0x00}}}, {}, {4, 0x90, 0x00}, NOCH, {R, M, CB, P}},
       {"ipc failed", 0x7E, {{-1, {0x6A, 0x81}}}, {}, {0x6A, 0x81}, FAIL, {R, M, CB, P}, 0, 0, 0,
        "phQVNciHal_Transmit_APDU_by_IPC failed!!!"},
       {"not ready", 0x7F, {}, {}, {}, IOERR, {R, CB, P}, 0, 0, -1, "phQVNciHal_Set_KORVA_READY failed!!!"},

@@ -1,6 +1,8 @@
 #include "fake_ese_hal.h"
 
 #include <algorithm>
+#include <chrono>
+#include <condition_variable>
 #include <cstdio>
 #include <cstring>
 #include <deque>
@@ -21,6 +23,10 @@ struct State {
   std::deque<TransceiveReply> trx;
   int32_t readyRc = 0, readyStatus = 0, initOpenRc = 0, eseType = 1;
   std::vector<std::string> calls;
+  // One IPC exchange can be held inside the library until the test lets go,
+  // standing in for a library call that does not return.
+  std::condition_variable cv;
+  bool blockNext = false, blocked = false, released = false;
 } g_s;
 
 using Lock = std::unique_lock<std::mutex>;
@@ -59,6 +65,22 @@ void reset() {
   g_s.readyRc = g_s.readyStatus = g_s.initOpenRc = 0;
   g_s.eseType = 1;
   g_s.calls.clear();
+  g_s.blockNext = g_s.blocked = g_s.released = false;
+}
+
+void blockNextIpc() {
+  Lock l(g_s.mu);
+  g_s.blockNext = true;
+  g_s.blocked = g_s.released = false;
+}
+bool waitIpcBlocked(int timeoutMs) {
+  Lock l(g_s.mu);
+  return g_s.cv.wait_for(l, std::chrono::milliseconds(timeoutMs), [] { return g_s.blocked; });
+}
+void releaseBlockedIpc() {
+  Lock l(g_s.mu);
+  g_s.released = true;
+  g_s.cv.notify_all();
 }
 
 void queueIpc(const IpcReply& reply) {
@@ -105,6 +127,12 @@ int32_t phQVNciHal_Set_KORVA_Power(const char* what) {
 int32_t phQVNciHal_Transmit_APDU_by_IPC(phQvEse_data* cmd, phQvEse_data* rsp) {
   fake_ese::Lock l(g_s.mu);
   fake_ese::record("ipc " + fake_ese::hexBytes(cmd->p_data, cmd->len));
+  if (g_s.blockNext) {
+    g_s.blockNext = false;
+    g_s.blocked = true;
+    g_s.cv.notify_all();
+    g_s.cv.wait(l, [] { return g_s.released; });
+  }
   if (g_s.ipc.empty()) return -1;
   fake_ese::IpcReply r = g_s.ipc.front();
   g_s.ipc.pop_front();

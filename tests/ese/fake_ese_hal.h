@@ -43,6 +43,11 @@ std::vector<std::string> calls();
 void clearCalls();
 void note(const std::string& line);
 
+// The next IPC exchange waits inside the library until releaseBlockedIpc().
+void blockNextIpc();
+bool waitIpcBlocked(int timeoutMs);
+void releaseBlockedIpc();
+
 std::string hex(const std::vector<uint8_t>& bytes);  // "00 A4 04 00"
 
 }  // namespace fake_ese

@@ -255,6 +255,33 @@ TEST(ModemSimTest, ClosesThePortAfterNCommands) {
   EXPECT_EQ(sim.terminate(), 0);
 }
 
+// The answer forms a real modem may use instead of the default ones.
+TEST(ModemSimTest, BareOpenAnswersAndShortLengthFields) {
+  struct Case {
+    std::vector<std::string> options;
+    std::vector<std::pair<std::string, Lines>> exchanges;
+  };
+  const Case cases[] = {
+      {{"--bare-open"},
+       {{"AT+CCHO=\"A00000000101\"", {"257", "OK"}},
+        {"AT+CCHP=\"A00000000103\",4", {"258", "OK"}},
+        {"AT+CCHO=\"A000000001FF\"", {"+CME ERROR: 716"}},
+        {"AT+CGLA=257,12,\"000100000155\"", {"+CGLA: 6,\"559000\"", "OK"}}}},
+      {{"--short-length"},
+       {{"AT+CCHO=\"A00000000101\"", {"+CCHO: 257", "OK"}},
+        {"AT+CGLA=257,12,\"000100000155\"", {"+CGLA: 4,\"559000\"", "OK"}},
+        {"AT+CGLA=257,10,\"0002900000\"", {"+CGLA: 2,\"9000\"", "OK"}},
+        {"AT+CSIM=10,\"0020000001\"", {"+CSIM: 2,\"6D00\"", "OK"}}}},
+  };
+  for (const Case& c : cases) {
+    SCOPED_TRACE(c.options[0]);
+    Sim sim(c.options);
+    sim.readyLine();
+    ASSERT_TRUE(sim.openPort());
+    for (const auto& e : c.exchanges) EXPECT_EQ(sim.command(e.first), e.second) << e.first;
+  }
+}
+
 int runTool(const std::vector<std::string>& args, std::string* out) {
   std::string cmd = MODEM_SIM_PATH;
   for (const auto& a : args) cmd += " " + a;
@@ -271,6 +298,8 @@ TEST(ModemSimTest, HelpAndBadOptions) {
   std::string out;
   EXPECT_EQ(runTool({"--help"}, &out), 0);
   EXPECT_NE(out.find("--silent-on"), std::string::npos);
+  EXPECT_NE(out.find("--bare-open"), std::string::npos);
+  EXPECT_NE(out.find("--short-length"), std::string::npos);
   EXPECT_EQ(runTool({"--modem", "2"}, &out), 2);
   EXPECT_EQ(runTool({"--atr", "3B0"}, &out), 2);
   EXPECT_EQ(runTool({"--bogus"}, &out), 2);
