@@ -5,12 +5,12 @@
 // the daemon opens with types its policy declares; the XML is well formed.
 #include <gtest/gtest.h>
 
+#include <regex.h>
 #include <sys/wait.h>
 
 #include <algorithm>
 #include <cstdio>
 #include <fstream>
-#include <regex>
 #include <set>
 #include <sstream>
 #include <string>
@@ -27,6 +27,40 @@ namespace {
 using ::android::sp;
 using ::android::status_t;
 using ::android::hidl::base::V1_0::IBase;
+
+// POSIX extended regular expressions: every match of `pattern` in `text`,
+// each as its groups (0 = the whole match).
+std::vector<std::vector<std::string>> findAll(const std::string& pattern, const std::string& text) {
+  std::vector<std::vector<std::string>> out;
+  regex_t re;
+  if (regcomp(&re, pattern.c_str(), REG_EXTENDED | REG_NEWLINE) != 0) {
+    ADD_FAILURE() << "bad pattern " << pattern;
+    return out;
+  }
+  regmatch_t m[8];
+  size_t pos = 0;
+  while (pos <= text.size() && regexec(&re, text.c_str() + pos, 8, m, pos ? REG_NOTBOL : 0) == 0) {
+    std::vector<std::string> groups;
+    for (const regmatch_t& g : m) {
+      if (g.rm_so < 0) break;
+      groups.push_back(text.substr(pos + g.rm_so, g.rm_eo - g.rm_so));
+    }
+    out.push_back(groups);
+    pos += m[0].rm_eo > m[0].rm_so ? m[0].rm_eo : m[0].rm_so + 1;
+  }
+  regfree(&re);
+  return out;
+}
+
+// The groups of the first match, empty when none.
+std::vector<std::string> findFirst(const std::string& pattern, const std::string& text) {
+  auto all = findAll(pattern, text);
+  return all.empty() ? std::vector<std::string>() : all[0];
+}
+
+bool wholeMatch(const std::string& pattern, const std::string& text) {
+  return !findFirst("^(" + pattern + ")$", text).empty();
+}
 
 std::string readFile(const std::string& rel) {
   std::ifstream in(std::string(SE_SOURCE_DIR) + "/" + rel);
@@ -53,19 +87,15 @@ std::vector<std::string> bpList(const std::string& bp, const std::string& module
   const size_t k = block.find(key + ": [");
   if (k == std::string::npos) return out;
   const std::string list = block.substr(k, block.find(']', k) - k);
-  std::regex quoted("\"([^\"]*)\"");
-  for (std::sregex_iterator it(list.begin(), list.end(), quoted), e; it != e; ++it) {
-    out.push_back((*it)[1]);
-  }
+  for (const auto& g : findAll("\"([^\"]*)\"", list)) out.push_back(g[1]);
   return out;
 }
 
 std::string bpValue(const std::string& bp, const std::string& module, const std::string& key) {
   const size_t at = bp.find("name: \"" + module + "\"");
   const std::string block = bp.substr(at, bp.find("\n}", at) - at);
-  std::smatch m;
-  if (std::regex_search(block, m, std::regex(key + ": ([^,\n]*),"))) return m[1];
-  return "";
+  const auto g = findFirst(key + ": ([^,\n]*),", block);
+  return g.empty() ? "" : g[1];
 }
 
 std::vector<std::string> sorted(std::vector<std::string> v) {
@@ -107,13 +137,13 @@ TEST(DeviceFiles, AndroidBpBuildsExactlyTheDaemonSourcesOfTheCMakeTarget) {
 
 TEST(DeviceFiles, TheInitScriptStartsTheInstalledBinaryWithTheModemPortsGroup) {
   const std::string rc = readFile(bpList(kBp, kBinary, "init_rc").at(0));
-  std::smatch m;
-  ASSERT_TRUE(std::regex_search(rc, m, std::regex("\nservice (\\S+) (\\S+)\n"))) << rc;
-  EXPECT_EQ(m[2].str(), "/vendor/bin/hw/" + kBinary);
-  EXPECT_TRUE(std::regex_search(rc, std::regex("\n    class hal\n")));
-  EXPECT_TRUE(std::regex_search(rc, std::regex("\n    user \\S+\n")));
+  const auto service = findFirst("^service ([^ ]+) ([^ ]+)$", rc);
+  ASSERT_EQ(service.size(), 3u) << rc;
+  EXPECT_EQ(service[2], "/vendor/bin/hw/" + kBinary);
+  EXPECT_FALSE(findFirst("^    class hal$", rc).empty());
+  EXPECT_FALSE(findFirst("^    user [a-z_]+$", rc).empty());
   // The modem's AT ports belong to radio.
-  EXPECT_TRUE(std::regex_search(rc, std::regex("\n    group [^\n]*\\bradio\\b")));
+  EXPECT_FALSE(findFirst("^    group ([a-z_]+ )*radio( [a-z_]+)*$", rc).empty()) << rc;
 }
 
 // Names the daemon registers, with an eSE (so both instances of both kinds).
@@ -139,28 +169,27 @@ std::vector<std::string> registeredNames() {
 TEST(DeviceFiles, TheManifestDeclaresTheInstancesTheDaemonRegisters) {
   const std::string xml = readFile(bpList(kBp, kBinary, "vintf_fragments").at(0));
   std::vector<std::string> declared;
-  std::regex hal("<hal format=\"(\\w+)\">([\\s\\S]*?)</hal>");
-  for (std::sregex_iterator it(xml.begin(), xml.end(), hal), e; it != e; ++it) {
-    const std::string format = (*it)[1];
-    const std::string body = (*it)[2];
-    std::smatch name, version;
-    ASSERT_TRUE(std::regex_search(body, name, std::regex("<name>([^<]+)</name>")));
-    ASSERT_TRUE(std::regex_search(body, version, std::regex("<version>([^<]+)</version>")));
-    if (format == "hidl") {
-      std::smatch iface;
-      ASSERT_TRUE(std::regex_search(body, iface,
-                                    std::regex("<interface>\\s*<name>([^<]+)</name>")));
-      std::regex inst("<instance>([^<]+)</instance>");
-      for (std::sregex_iterator i(body.begin(), body.end(), inst), ie; i != ie; ++i) {
-        declared.push_back("hidl " + name[1].str() + "@" + version[1].str() + "::" +
-                           iface[1].str() + "/" + (*i)[1].str());
+  size_t at = 0;
+  while ((at = xml.find("<hal format=\"", at)) != std::string::npos) {
+    const size_t end = xml.find("</hal>", at);
+    ASSERT_NE(end, std::string::npos);
+    const std::string body = xml.substr(at, end - at);
+    at = end;
+    const auto format = findFirst("<hal format=\"([a-z]+)\">", body);
+    const auto name = findFirst("<name>([^<]+)</name>", body);
+    const auto version = findFirst("<version>([^<]+)</version>", body);
+    ASSERT_FALSE(format.empty() || name.empty() || version.empty()) << body;
+    if (format[1] == "hidl") {
+      const auto iface = findFirst("<interface>[[:space:]]*<name>([^<]+)</name>", body);
+      ASSERT_FALSE(iface.empty()) << body;
+      for (const auto& i : findAll("<instance>([^<]+)</instance>", body)) {
+        declared.push_back("hidl " + name[1] + "@" + version[1] + "::" + iface[1] + "/" + i[1]);
       }
     } else {
-      EXPECT_EQ(format, "aidl");
-      EXPECT_EQ(version[1].str(), "1");
-      std::regex fq("<fqname>([^<]+)</fqname>");
-      for (std::sregex_iterator i(body.begin(), body.end(), fq), ie; i != ie; ++i) {
-        declared.push_back("aidl " + name[1].str() + "." + (*i)[1].str());
+      EXPECT_EQ(format[1], "aidl");
+      EXPECT_EQ(version[1], "1");
+      for (const auto& f : findAll("<fqname>([^<]+)</fqname>", body)) {
+        declared.push_back("aidl " + name[1] + "." + f[1]);
       }
     }
   }
@@ -186,21 +215,20 @@ TEST(DeviceFiles, SelinuxLabelsTheBinaryAndTheDaemonsDevicesWithDeclaredTypes) {
   const std::string contexts = readFile("android/sepolicy/file_contexts");
   const std::string te = readFile("android/sepolicy/hal_secure_element_qvese.te");
   struct Entry {
-    std::regex path;
+    std::string path;  // a regular expression over the whole path
     std::string type;
   };
   std::vector<Entry> entries;
-  std::regex line("^(\\S+)\\s+u:object_r:(\\w+):s0$");
   for (const std::string& l : lines(contexts)) {
-    std::smatch m;
     if (l.empty() || l[0] == '#') continue;
-    ASSERT_TRUE(std::regex_match(l, m, line)) << l;
-    entries.push_back({std::regex(m[1].str()), m[2]});
-    EXPECT_NE(te.find("type " + m[2].str() + ","), std::string::npos) << m[2];
+    const auto m = findFirst("^([^ ]+) +u:object_r:([a-z0-9_]+):s0$", l);
+    ASSERT_EQ(m.size(), 3u) << l;
+    entries.push_back({m[1], m[2]});
+    EXPECT_NE(te.find("type " + m[2] + ","), std::string::npos) << m[2];
   }
   auto labelOf = [&](const std::string& path) {
     for (const Entry& e : entries)
-      if (std::regex_match(path, e.path)) return e.type;
+      if (wholeMatch(e.path, path)) return e.type;
     return std::string();
   };
   EXPECT_EQ(labelOf("/vendor/bin/hw/" + kBinary), "hal_secure_element_qvese_exec");
