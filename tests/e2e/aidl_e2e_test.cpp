@@ -112,6 +112,21 @@ class AidlEndToEnd : public ::testing::Test {
         << daemon->err().text();
   }
   size_t modemMark() { return modem->err().size(); }
+  // init, and for SIM1 until its worker has the modem port: the SIM front
+  // reports ready once the worker is started, and the worker opens the port
+  // in its own time. Waits on the worker's log line, then on the front's
+  // own answer (one more round at most).
+  std::string initReady(Client& c, const std::string& instance) {
+    const std::string st = c.init();
+    if (instance != "SIM1" || st != "SUCCESS") return st;
+    EXPECT_TRUE(daemon->err().waitFor("at_open,ac->index=0"));
+    bool present = false;
+    for (int round = 0; round < 100 && !present; ++round) {
+      if (!c.se->isCardPresent(&present).isOk()) break;
+    }
+    EXPECT_TRUE(present);
+    return st;
+  }
   // Waits until the logs hold everything that came before: a presence query
   // goes through the same front (and for SIM1 the modem) after it.
   void settle(Client& c, const std::string& instance) {
@@ -156,7 +171,7 @@ TEST_F(AidlEndToEnd, LogicalChannelsAnswerWithAChannelAndASelectResponseOrAnErro
   for (const std::string& instance : kInstances) {
     SCOPED_TRACE(instance);
     Client c(instance);
-    ASSERT_EQ(c.init(), "SUCCESS");
+    ASSERT_EQ(initReady(c, instance), "SUCCESS");
     std::vector<int> opened;
     for (int i = 0; i < 2; ++i) {
       LogicalChannelResponse resp;
@@ -191,7 +206,7 @@ TEST_F(AidlEndToEnd, ClosingAChannelThatIsNotOpenFailsAndSendsNothing) {
   for (const std::string& instance : kInstances) {
     SCOPED_TRACE(instance);
     Client c(instance);
-    ASSERT_EQ(c.init(), "SUCCESS");
+    ASSERT_EQ(initReady(c, instance), "SUCCESS");
     LogicalChannelResponse resp;
     ASSERT_EQ(c.open(kEchoAid, &resp), "SUCCESS");
     const int ch = resp.channelNumber;
@@ -233,7 +248,7 @@ TEST_F(AidlEndToEnd, TheBasicChannelOpensOnceUntilClosedOnEse1AndNeverOnSim1) {
   EXPECT_EQ(nameOf(ese.se->openBasicChannel(kMissingAid, 0, &select)), "NO_SUCH_ELEMENT_ERROR");
 
   Client sim("SIM1");
-  ASSERT_EQ(sim.init(), "SUCCESS");
+  ASSERT_EQ(initReady(sim, "SIM1"), "SUCCESS");
   ASSERT_NO_FATAL_FAILURE(settle(sim, "SIM1"));
   const size_t mmark = modemMark();
   EXPECT_EQ(nameOf(sim.se->openBasicChannel(kEchoAid, 0, &select)), "CHANNEL_NOT_AVAILABLE");
@@ -247,7 +262,7 @@ TEST_F(AidlEndToEnd, ResetClosesEveryChannelAndReportsFalseThenTrue) {
   for (const std::string& instance : kInstances) {
     SCOPED_TRACE(instance);
     Client c(instance);
-    ASSERT_EQ(c.init(), "SUCCESS");
+    ASSERT_EQ(initReady(c, instance), "SUCCESS");
     LogicalChannelResponse a, b;
     ASSERT_EQ(c.open(kEchoAid, &a), "SUCCESS");
     ASSERT_EQ(c.open(kEchoAid, &b), "SUCCESS");
@@ -306,7 +321,7 @@ TEST_F(AidlEndToEnd, AFailedExchangeIsAnErrorNotAnEmptySuccess) {
   Client ese("eSE1");
   Client sim("SIM1");
   ASSERT_EQ(ese.init(), "SUCCESS");
-  ASSERT_EQ(sim.init(), "SUCCESS");
+  ASSERT_EQ(initReady(sim, "SIM1"), "SUCCESS");
   LogicalChannelResponse e, s;
   ASSERT_EQ(ese.open(kEchoAid, &e), "SUCCESS");
   ASSERT_EQ(sim.open(kEchoAid, &s), "SUCCESS");
@@ -329,7 +344,7 @@ TEST_F(AidlEndToEnd, HidlAndAidlClientsShareChannels) {
     SCOPED_TRACE(instance);
     Client a(instance);
     SecliSession h(root, instance);
-    ASSERT_EQ(a.init(), "SUCCESS");
+    ASSERT_EQ(initReady(a, instance), "SUCCESS");
     ASSERT_EQ(field(h.call("init"), "state"), "true");
 
     LogicalChannelResponse resp;
