@@ -568,6 +568,11 @@ SecureElementStatus SecureElement::internalCloseChannel(uint8_t channelNumber) {
   return closeChannelUnlocked(channelNumber, "internalCloseChannel");
 }
 
+bool SecureElement::isLogicalChannelOpen(uint8_t channelNumber) {
+  return channelNumber != 0 && isTracked(channelNumber) &&
+         g_openedChannels[channelNumber].load() == 1;
+}
+
 void SecureElement::serviceDied(uint64_t /*cookie*/, const wp<IBase>& /*who*/) {
   __android_log_print(ANDROID_LOG_ERROR, kTag, "%s enter!", "serviceDied");
   // Death notices come on a pool thread; one must not wait behind a library

@@ -54,6 +54,10 @@ struct SecureElement : public ISecureElement, public hidl_death_recipient {
   // Closes a logical channel without taking the lock: callers either hold it
   // already (a failed open) or run beside it on purpose (init).
   static SecureElementStatus internalCloseChannel(uint8_t channelNumber);
+
+  // Whether logical channel `channelNumber` is held open by this front (its
+  // channel table); false for 0, the basic channel, which it does not track.
+  static bool isLogicalChannelOpen(uint8_t channelNumber);
 };
 
 }  // namespace implementation

@@ -14,8 +14,9 @@ Builds the programs when needed, then in a fresh temporary device root:
 writes the properties and the NFC sysfs nodes, starts modem-sim, starts the
 daemon with the simulated eSE library, and runs a secli session on "eSE1" and
 on "SIM1" (init, presence, ATR, logical channels, APDUs, an answer in several
-parts fetched with GET RESPONSE, close, the basic channel), checking every
-answer. Every process it starts is stopped at the end.
+parts fetched with GET RESPONSE, close, the basic channel), then an AIDL
+session on "eSE1" (init, open, transmit, reset), checking every answer.
+Every process it starts is stopped at the end.
 
   --two-modems  run a second modem-sim (modem 1, another ATR) and show "SIM1"
                 following the NFC SIM switch node to it
@@ -102,12 +103,13 @@ cla_of() { # the CLA naming logical channel $1
   if [ "$1" -lt 4 ]; then printf '%02X' "$1"; else printf '%02X' $((0x40 | ($1 - 4))); fi
 }
 
-# Starts secli on instance $1, reading commands from us one at a time.
+# Starts secli on instance $1 (more secli options after it, e.g. --aidl),
+# reading commands from us one at a time.
 session_start() {
-  err_file=$root/secli-$1.err
+  err_file=$root/secli-$1${2:-}.err
   : >"$err_file"
   trace_seen=0
-  coproc SECLI { exec "${pd[@]}" "$bin/secli" --root "$root" --chain --trace --timeout 20 -i "$1" -f - 2>"$err_file"; }
+  coproc SECLI { exec "${pd[@]}" "$bin/secli" --root "$root" --chain --trace --timeout 20 -i "$1" "${@:2}" -f - 2>"$err_file"; }
   pids+=("$SECLI_PID")
   out_fd=${SECLI[0]}
 }
@@ -199,6 +201,7 @@ fi
 SE_DEVICE_ROOT=$root "${pd[@]}" "$bin/qvese@1.0-service" 2>"$root/daemon.log" &
 pids+=($!)
 wait_for "$root/daemon.log" "Registered sim1 success" || exit 1
+wait_for "$root/daemon.log" "AIDL Registered android.hardware.secure_element.ISecureElement/SIM1 success" || exit 1
 echo "daemon:      qvese@1.0-service, instances: $("$bin/secli" --root "$root" list | tr '\n' ' ')(log: daemon.log)"
 
 # ---- eSE1 ---------------------------------------------------------------------------
@@ -265,6 +268,23 @@ if [ "$two_modems" = 1 ]; then
   echo 1 >"$root/sys/nfc/nfc_sim_switch"
   step "switched back: modem 0 again" '^atr=3B 86' atr "selectmodem=0"
 fi
+session_end
+
+# ---- eSE1 over AIDL -------------------------------------------------------------------
+echo
+echo "== eSE1 over AIDL (android.hardware.secure_element.ISecureElement/eSE1): the same card =="
+session_start eSE1 --aidl
+step "init: onStateChange(true) with a reason" '^SUCCESS state=true reason="eSE1 is ready"$' init \
+  "phQvEse_init_open"
+step "open a logical channel to the echo applet" '^SUCCESS channel=[1-3] select=6F' "open $ECHO"
+e=$(channel)
+step "an APDU on it" '^SUCCESS AA BB CC 90 00' "transmit $(cla_of "$e") 01 00 00 03 AA BB CC"
+step "an applet the card does not have: the error comes as a status" '^NO_SUCH_ELEMENT_ERROR' \
+  "open $NONE"
+step "reset: channels closed, the eSE closed and opened again, states false then true" \
+  '^SUCCESS states=false,true$' reset "phQvEse_close"
+step "the channel is gone after the reset" '^CHANNEL_NOT_AVAILABLE' \
+  "transmit $(cla_of "$e") 01 00 00 01 AA"
 session_end
 
 echo

@@ -1,9 +1,9 @@
 #!/usr/bin/env bash
 # Installs the Debian packages the build needs, when any is missing.
-#   scripts/deps.sh        compilers, CMake and GoogleTest
+#   scripts/deps.sh        compilers, CMake, GoogleTest and xmllint (device files check)
 #   scripts/deps.sh fuzz   also clang and its runtimes (libFuzzer, sanitizers)
 set -euo pipefail
-pkgs=(cmake make g++ libgtest-dev libgmock-dev)
+pkgs=(cmake make g++ libgtest-dev libgmock-dev libxml2-utils)
 if [ "${1:-}" = fuzz ]; then
   pkgs+=(clang libclang-rt-14-dev)
 fi

@@ -1,5 +1,6 @@
 #include "secli_lib.h"
 
+#include <host/aidl_host.h>
 #include <host/rpc_host.h>
 
 #include <cerrno>
@@ -12,6 +13,10 @@
 #include <thread>
 
 namespace secli {
+
+// The AIDL results' fields and line (secli_aidl.cpp).
+std::string aidlJsonFields(const Result& r);
+std::string aidlHumanLine(const Result& r);
 
 using ::android::sp;
 using ::android::hardware::hidl_vec;
@@ -105,6 +110,9 @@ const CommandInfo kCommands[] = {
      "the response with its status word."},
     {"close", CommandKind::Close, "close CHANNEL", "Closes a channel."},
     {"sleep", CommandKind::Sleep, "sleep MS", "Waits MS milliseconds (for scripts)."},
+    {"reset", CommandKind::Reset, "reset",
+     "Resets the element (AIDL only): every channel closed, then onStateChange\n"
+     "false and true again; prints the states received."},
 };
 
 std::vector<std::string> wordsOf(const std::string& text) {
@@ -239,6 +247,7 @@ bool parseCommand(const std::vector<std::string>& words, Command* out, std::stri
     case CommandKind::Init:
     case CommandKind::Present:
     case CommandKind::Atr:
+    case CommandKind::Reset:
       if (nargs != 0) return usage(std::string(info->name) + " takes no argument");
       break;
     case CommandKind::Open:
@@ -361,9 +370,12 @@ std::string statusWordNote(const std::vector<uint8_t>& response) {
   return "(" + code + (meaning.empty() ? "" : ": " + meaning) + ")";
 }
 
+std::string jsonText(const std::string& s) { return jsonString(s); }
+
 std::string formatJson(const Result& r) {
   std::string s = "{\"cmd\":" + jsonString(r.cmd);
   if (!r.error.empty()) return s + ",\"error\":" + jsonString(r.error) + "}";
+  if (r.aidl) return s + aidlJsonFields(r) + "}";
   switch (r.kind) {
     case CommandKind::Init:
       s += ",\"state\":";
@@ -393,6 +405,8 @@ std::string formatJson(const Result& r) {
     case CommandKind::Sleep:
       s += ",\"ms\":" + std::to_string(r.ms);
       break;
+    case CommandKind::Reset:
+      break;
   }
   return s + "}";
 }
@@ -400,6 +414,7 @@ std::string formatJson(const Result& r) {
 std::string formatHuman(const Result& r) {
   // Transport errors are reported on standard error by the caller.
   if (!r.error.empty()) return "";
+  if (r.aidl) return aidlHumanLine(r);
   auto withNote = [](const std::string& text, const std::vector<uint8_t>& data) {
     std::string note = statusWordNote(data);
     return note.empty() ? text : text + " " + note;
@@ -423,6 +438,7 @@ std::string formatHuman(const Result& r) {
     case CommandKind::Close:
       return statusName(r.status);
     case CommandKind::Sleep:
+    case CommandKind::Reset:
       return "";
   }
   return "";
@@ -517,6 +533,9 @@ Result Session::run(const Command& c) {
       std::this_thread::sleep_for(std::chrono::milliseconds(c.ms));
       r.ms = c.ms;
       break;
+    case CommandKind::Reset:
+      r.error = "reset is an AIDL call (--aidl)";
+      break;
   }
   return r;
 }
@@ -605,6 +624,8 @@ std::string mainHelp() {
       "  --timeout SECONDS  limit for each call, and how long init waits for\n"
       "                     onStateChange (default 10)\n"
       "  -i NAME            the instance, e.g. SIM1 or eSE1 (see 'list')\n"
+      "  --aidl             speak the AIDL interface to the instance (the same\n"
+      "                     name): errors come back as statuses by name\n"
       "  -f FILE            run the commands of FILE (- for standard input), one a\n"
       "                     line, '#' starts a comment; all on one connection\n"
       "  --chain            transmit follows 61xx with GET RESPONSE on the same\n"
@@ -648,15 +669,18 @@ std::string mainHelp() {
        "  secli -i SIM1 init\n"
        "  secli -i SIM1 open A0000001510000 0x00\n"
        "  secli -i SIM1 transmit 81 CA 9F 7F 00\n"
-       "  secli -i eSE1 --chain --trace -f session.txt\n";
+       "  secli -i eSE1 --chain --trace -f session.txt\n"
+       "  secli --aidl -i eSE1 -f session.txt   # init, open, transmit, reset\n";
   return s;
 }
 
 std::string commandHelp(const std::string& command) {
   if (command == "list") {
     return "Usage: secli [--root DIR] [--json] list [--wait SECONDS]\n"
-           "Lists the registered instances, one a line. With --wait, waits up to\n"
-           "SECONDS until at least one is registered (exit 1 if none came).\n";
+           "Lists the registered instances, one a line: HIDL ones by their name\n"
+           "(eSE1), AIDL ones by their full name\n"
+           "(android.hardware.secure_element.ISecureElement/eSE1). With --wait, waits\n"
+           "up to SECONDS until at least one is registered (exit 1 if none came).\n";
   }
   const CommandInfo* info = findCommand(command);
   if (info == nullptr) return mainHelp();
@@ -687,6 +711,8 @@ ArgsOutcome parseArgs(const std::vector<std::string>& args, Options* out, std::s
       o.chain = true;
     } else if (a == "--trace") {
       o.trace = true;
+    } else if (a == "--aidl") {
+      o.aidl = true;
     } else if (a == "--root" || a.rfind("--root=", 0) == 0) {
       if (a == "--root") {
         if (!value(a, &v)) return ArgsOutcome::Usage;
@@ -764,6 +790,10 @@ ArgsOutcome parseArgs(const std::vector<std::string>& args, Options* out, std::s
   if (!o.command.empty()) {
     Command c;
     if (!parseCommand(o.command, &c, message)) return ArgsOutcome::Usage;
+    if (c.kind == CommandKind::Reset && !o.aidl) {
+      *message = "reset is an AIDL call; add --aidl";
+      return ArgsOutcome::Usage;
+    }
   }
   *out = std::move(o);
   return ArgsOutcome::Run;
@@ -774,10 +804,15 @@ namespace {
 int runList(const Options& o, FILE* out, FILE* err) {
   auto deadline =
       std::chrono::steady_clock::now() + std::chrono::milliseconds(o.listWaitMs < 0 ? 0 : o.listWaitMs);
-  std::vector<std::string> names = ::android::host::listServices();
+  auto both = [] {
+    std::vector<std::string> names = ::android::host::listServices();
+    for (auto& n : ::android::host::listAidlServices()) names.push_back(n);
+    return names;
+  };
+  std::vector<std::string> names = both();
   while (o.listWaitMs >= 0 && names.empty() && std::chrono::steady_clock::now() < deadline) {
     std::this_thread::sleep_for(std::chrono::milliseconds(50));
-    names = ::android::host::listServices();
+    names = both();
   }
   if (o.json) {
     std::string s = "{\"cmd\":\"list\",\"instances\":[";
@@ -838,18 +873,42 @@ int runMain(const std::vector<std::string>& args, FILE* out, FILE* err, FILE* in
     }
   }
 
-  sp<ISecureElement> se = ISecureElement::getService(o.instance);
-  if (se == nullptr) {
-    fprintf(err, "secli: no instance %s (%s)\n", o.instance.c_str(),
-            ::android::host::serviceSocketPath(o.instance).c_str());
-    return 1;
+  if (!o.aidl) {
+    for (const Command& c : commands) {
+      if (c.kind == CommandKind::Reset) {
+        fprintf(err, "secli: reset is an AIDL call; add --aidl\n");
+        return 2;
+      }
+    }
   }
-  ::android::host::setCallTimeout(se, o.timeoutMs);
-  Session session(se, o.timeoutMs);
-  session.setChain(o.chain);
-  if (o.trace) session.setTrace(err);
+  std::function<Result(const Command&)> runCommand;
+  std::unique_ptr<Session> session;
+  std::unique_ptr<AidlSession> aidlSession;
+  if (o.aidl) {
+    aidlSession = AidlSession::connect(o.instance, o.timeoutMs);
+    if (aidlSession == nullptr) {
+      fprintf(err, "secli: no AIDL instance %s (%s)\n", o.instance.c_str(),
+              ::android::host::aidlSocketPath(aidlInstanceName(o.instance)).c_str());
+      return 1;
+    }
+    aidlSession->setChain(o.chain);
+    if (o.trace) aidlSession->setTrace(err);
+    runCommand = [&](const Command& c) { return aidlSession->run(c); };
+  } else {
+    sp<ISecureElement> se = ISecureElement::getService(o.instance);
+    if (se == nullptr) {
+      fprintf(err, "secli: no instance %s (%s)\n", o.instance.c_str(),
+              ::android::host::serviceSocketPath(o.instance).c_str());
+      return 1;
+    }
+    ::android::host::setCallTimeout(se, o.timeoutMs);
+    session = std::make_unique<Session>(se, o.timeoutMs);
+    session->setChain(o.chain);
+    if (o.trace) session->setTrace(err);
+    runCommand = [&](const Command& c) { return session->run(c); };
+  }
   auto runOne = [&](const Command& c) {
-    Result r = session.run(c);
+    Result r = runCommand(c);
     std::string text = o.json ? formatJson(r) : formatHuman(r);
     if (!text.empty()) fprintf(out, "%s\n", text.c_str());
     fflush(out);
@@ -876,6 +935,11 @@ int runMain(const std::vector<std::string>& args, FILE* out, FILE* err, FILE* in
       break;
     }
     if (words.empty()) continue;
+    if (c.kind == CommandKind::Reset && !o.aidl) {
+      fprintf(err, "secli: line %d: reset is an AIDL call; add --aidl\n", n);
+      status = 2;
+      break;
+    }
     if (!runOne(c)) {
       status = 1;
       break;

@@ -4,6 +4,7 @@
 #include <cstdint>
 #include <cstdio>
 #include <functional>
+#include <memory>
 #include <optional>
 #include <string>
 #include <vector>
@@ -15,7 +16,7 @@ namespace secli {
 using ::android::hardware::secure_element::V1_0::ISecureElement;
 using ::android::hardware::secure_element::V1_0::SecureElementStatus;
 
-enum class CommandKind { Init, Present, Atr, Open, Basic, Transmit, Close, Sleep };
+enum class CommandKind { Init, Present, Atr, Open, Basic, Transmit, Close, Sleep, Reset };
 
 struct Command {
   CommandKind kind = CommandKind::Present;
@@ -55,6 +56,13 @@ struct Result {
   uint32_t ms = 0;                 // sleep
   double waitedSeconds = 0;        // init: the time-out that ran out
   int exchanges = 1;               // transmit: APDUs sent (more with --chain)
+  // AIDL calls: the call's status ("SUCCESS" or the error's name) with its
+  // message; results are meaningful only on SUCCESS.
+  bool aidl = false;
+  std::string aidlStatus;
+  std::string aidlMessage;
+  std::optional<std::string> reason;  // init: the onStateChange reason
+  std::vector<bool> states;           // reset: the connected values received, in order
 };
 
 // The channel a command's CLA names: 0-3 in a first interindustry class,
@@ -76,6 +84,8 @@ using TransmitFn = std::function<std::vector<uint8_t>(const std::vector<uint8_t>
 std::vector<uint8_t> transmitChained(const std::vector<uint8_t>& apdu, const TransmitFn& send,
                                      int* exchanges = nullptr);
 
+// `s` as a quoted JSON string.
+std::string jsonText(const std::string& s);
 // One JSON object, no newline.
 std::string formatJson(const Result& r);
 // One human line, no newline; "" when there is nothing to say (sleep).
@@ -101,6 +111,20 @@ class Session {
   FILE* mTrace = nullptr;
 };
 
+// The same commands over the AIDL interface (secli_aidl.cpp). One callback
+// per session, passed by init and kept for reset's state changes.
+class AidlSession {
+ public:
+  // `instance` is the short name (eSE1); the full AIDL name is made here.
+  static std::unique_ptr<AidlSession> connect(const std::string& instance, int timeoutMs);
+  virtual ~AidlSession() = default;
+  virtual Result run(const Command& c) = 0;
+  virtual void setChain(bool on) = 0;
+  virtual void setTrace(FILE* trace) = 0;
+};
+// The full AIDL instance name of a short one.
+std::string aidlInstanceName(const std::string& instance);
+
 // Command line.
 struct Options {
   std::string root;          // --root; empty: $SE_DEVICE_ROOT
@@ -108,6 +132,7 @@ struct Options {
   int timeoutMs = 10000;     // --timeout SECONDS
   bool chain = false;        // --chain
   bool trace = false;        // --trace
+  bool aidl = false;         // --aidl
   std::string instance;      // -i NAME
   std::string script;        // -f FILE ("-": standard input)
   bool list = false;         // the list command

@@ -2,11 +2,17 @@
 
 #include <cstdint>
 
+#include <android/binder_manager.h>
+#include <android/binder_process.h>
 #include <hidl/HidlTransportSupport.h>
 #include <log/log.h>
 
+#include <memory>
+#include <string>
+
 #include "SecureElement.h"
 #include "ZerbSimSecureElement.h"
+#include "aidl_front.h"
 #include "ese_qv_hal.h"
 
 using ::android::OK;
@@ -15,10 +21,26 @@ using ::android::hardware::configureRpcThreadpool;
 using ::android::hardware::joinRpcThreadpool;
 using ::android::hardware::secure_element::V1_0::implementation::SecureElement;
 using ::android::hardware::secure_element::V1_0::implementation::ZerbSimSecureElement;
+using AidlFront = ::aidl::android::hardware::secure_element::AidlFront;
+using AidlISecureElement = ::aidl::android::hardware::secure_element::ISecureElement;
 
 namespace {
 constexpr const char* kTag = "qvese@1.0-service";
 constexpr size_t kRpcThreads = 2;
+// Binder threads the driver may add beside the one the pool starts with: two
+// for AIDL calls, as the HIDL pool has. (On a host both share one pool.)
+constexpr uint32_t kAidlExtraThreads = 1;
+
+// Serves `front` as the AIDL instance `instance`; false (logged) on failure.
+bool registerAidl(const std::shared_ptr<AidlFront>& front, const char* instance) {
+  const std::string name = std::string(AidlISecureElement::descriptor) + "/" + instance;
+  if (AServiceManager_addService(front->asBinder().get(), name.c_str()) != EX_NONE) {
+    __android_log_print(ANDROID_LOG_ERROR, kTag, "AIDL Registered %s fail", name.c_str());
+    return false;
+  }
+  __android_log_print(ANDROID_LOG_INFO, kTag, "AIDL Registered %s success", name.c_str());
+  return true;
+}
 }  // namespace
 
 int qvese_service_main() {
@@ -50,6 +72,23 @@ int qvese_service_main() {
     return 1;
   }
   __android_log_print(ANDROID_LOG_INFO, kTag, "ZerbSimSecureElement Registered sim1 success");
+
+  // The AIDL faces of the same objects, after the HIDL instances: eSE1 only
+  // where the HIDL eSE1 is served.
+  ABinderProcess_setThreadPoolMaxThreadCount(kAidlExtraThreads);
+  std::shared_ptr<AidlFront> aidlEse;
+  if (ese != nullptr) {
+    aidlEse = ::ndk::SharedRefBase::make<AidlFront>(
+        ese, "eSE1",
+        AidlFront::Element{SecureElement::isLogicalChannelOpen, [] { phQvEse_close(); }});
+    if (!registerAidl(aidlEse, "eSE1")) return 1;
+  }
+  // The SIM's channels are closed on the modem by the reset itself; the
+  // modem's port stays open.
+  auto aidlSim = ::ndk::SharedRefBase::make<AidlFront>(
+      sim, "SIM1", AidlFront::Element{ZerbSimSecureElement::isChannelOpen, [] {}});
+  if (!registerAidl(aidlSim, "SIM1")) return 1;
+  ABinderProcess_startThreadPool();
 
   joinRpcThreadpool();
   // The pool is not expected to give the thread back.

@@ -285,6 +285,12 @@ Return<SecureElementStatus> ZerbSimSecureElement::closeChannel(uint8_t channelNu
   return status;
 }
 
+bool ZerbSimSecureElement::isChannelOpen(uint8_t channelNumber) {
+  if (channelNumber >= SIM_CHANNEL_MAX) return false;
+  SimLock lock;
+  return g_simOpenedChannels[channelNumber] != 0;
+}
+
 void ZerbSimSecureElement::serviceDied(uint64_t, const wp<IBase>&) {
   SIM_LOGD("%s, enter, modem_id: %d", "serviceDied", m_modem_id.load());
 }

@@ -60,6 +60,10 @@ struct ZerbSimSecureElement : public ISecureElement, public hidl_death_recipient
 
   int modemId() const { return m_modem_id.load(); }
 
+  // Whether `channelNumber` was opened through this front and not closed
+  // through it (g_simOpenedChannels, read under the front's lock).
+  static bool isChannelOpen(uint8_t channelNumber);
+
  private:
   void selectModem(const char* operation);
 

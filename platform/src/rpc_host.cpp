@@ -408,12 +408,14 @@ class Host {
     mTaskCv.notify_all();
   }
 
-  status_t add(const std::string& name, const sp<IBase>& service, StubFn stub) {
+  // Listens for `name` in the socket folder `dir`: HIDL and AIDL instances
+  // differ only in their folder and share this loop and pool.
+  status_t add(const std::string& dir, const std::string& name, const sp<IBase>& service,
+               StubFn stub) {
     if (!validServiceName(name) || service == nullptr || stub == nullptr) {
       RPC_LOGE("cannot register instance \"%s\": invalid name or object", name.c_str());
       return BAD_VALUE;
     }
-    std::string dir = serviceSocketDir();
     std::string path = dir + "/" + name;
     sockaddr_un addr;
     if (!fillAddress(path, &addr)) {
@@ -422,7 +424,7 @@ class Host {
     }
     std::lock_guard<std::mutex> g(mLock);
     for (auto& l : mListeners) {
-      if (l->name == name) {
+      if (l->path == path) {
         // Registering a name again replaces the object served under it.
         l->service = service;
         l->stub = stub;
@@ -955,7 +957,18 @@ RemotePeer* peerOf(const sp<IBase>& object) {
 
 status_t registerService(const std::string&, const std::string& name, const sp<IBase>& service,
                          StubFn stub) {
-  return Host::get().add(name, service, stub);
+  return Host::get().add(serviceSocketDir(), name, service, stub);
+}
+
+status_t registerServiceIn(const std::string& dir, const std::string& name,
+                           const sp<IBase>& service, StubFn stub) {
+  return Host::get().add(dir, name, service, stub);
+}
+
+std::shared_ptr<RemotePeer> connectPath(const std::string& path, std::string* error) {
+  int fd = connectTo(path, error);
+  if (fd < 0) return nullptr;
+  return std::make_shared<ClientPeer>(UniqueFd(fd));
 }
 
 std::shared_ptr<RemotePeer> connectService(const std::string& name, std::string* error) {

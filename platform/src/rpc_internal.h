@@ -83,6 +83,13 @@ status_t registerService(const std::string& descriptor, const std::string& name,
 // Client side: a connection to the instance `name`, or null (reason in *error).
 std::shared_ptr<RemotePeer> connectService(const std::string& name, std::string* error);
 
+// As registerService, listening in the socket folder `dir` instead of the
+// HIDL one; served by the same I/O loop and pool.
+status_t registerServiceIn(const std::string& dir, const std::string& name,
+                           const sp<hidl::base::V1_0::IBase>& service, StubFn stub);
+// Client side: a connection to the socket at `path`, or null (reason in *error).
+std::shared_ptr<RemotePeer> connectPath(const std::string& path, std::string* error);
+
 }  // namespace rpc
 }  // namespace host
 }  // namespace android

@@ -190,7 +190,7 @@ TEST_F(EndToEnd, WithoutAnEseOnlySim1IsServed) {
   EXPECT_TRUE(daemon->err().waitFor("g_ese_type = 0!"));
   std::string out;
   EXPECT_EQ(secli(root, {"list"}, &out), 0);
-  EXPECT_EQ(out, "SIM1\n");
+  EXPECT_EQ(out, "SIM1\nandroid.hardware.secure_element.ISecureElement/SIM1\n");
   EXPECT_EQ(daemon->err().text().find("eSE1"), std::string::npos);
   EXPECT_EQ(secli(root, {"-i", "eSE1", "present"}, &out), 1);
   SecliSession sim(root, "SIM1");

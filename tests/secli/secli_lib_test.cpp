@@ -426,3 +426,90 @@ TEST(SecliChain, ACardThatNeverStopsIsLeftAfterABound) {
 }
 
 }  // namespace
+
+namespace {
+
+// AIDL results: the status by name first; results only with SUCCESS; init's
+// reason and reset's states.
+TEST(SecliOutput, AidlJsonAndHumanLines) {
+  auto aidl = [](CommandKind kind, const char* cmd, const char* status) {
+    Result r;
+    r.kind = kind;
+    r.cmd = cmd;
+    r.aidl = true;
+    r.aidlStatus = status;
+    return r;
+  };
+  struct Case {
+    Result r;
+    std::string json, human;
+  };
+  std::vector<Case> cases;
+  {
+    Result r = aidl(CommandKind::Init, "init", "SUCCESS");
+    r.state = true;
+    r.reason = "eSE1 is ready";
+    cases.push_back({r, R"({"cmd":"init","status":"SUCCESS","state":true,"reason":"eSE1 is ready"})",
+                     R"(SUCCESS state=true reason="eSE1 is ready")"});
+  }
+  {
+    Result r = aidl(CommandKind::Reset, "reset", "SUCCESS");
+    r.states = {false, true};
+    cases.push_back({r, R"({"cmd":"reset","status":"SUCCESS","states":[false,true]})",
+                     "SUCCESS states=false,true"});
+  }
+  {
+    Result r = aidl(CommandKind::Reset, "reset", "FAILED");
+    r.states = {false};
+    r.aidlMessage = "eSE1 did not come back";
+    cases.push_back({r, R"({"cmd":"reset","status":"FAILED","message":"eSE1 did not come back","states":[false]})",
+                     "FAILED (eSE1 did not come back)"});
+  }
+  {
+    Result r = aidl(CommandKind::Open, "open", "NO_SUCH_ELEMENT_ERROR");
+    r.channel = 3;  // not a result of a failed call: not shown
+    r.data = {0x90, 0x00};
+    cases.push_back({r, R"({"cmd":"open","status":"NO_SUCH_ELEMENT_ERROR"})", "NO_SUCH_ELEMENT_ERROR"});
+  }
+  {
+    Result r = aidl(CommandKind::Open, "open", "SUCCESS");
+    r.channel = 2;
+    r.data = {0x6F, 0x00, 0x90, 0x00};
+    cases.push_back({r, R"({"cmd":"open","status":"SUCCESS","channel":2,"select":"6F009000"})",
+                     "SUCCESS channel=2 select=6F009000 (9000: OK)"});
+  }
+  {
+    Result r = aidl(CommandKind::Transmit, "transmit", "CHANNEL_NOT_AVAILABLE");
+    cases.push_back({r, R"({"cmd":"transmit","status":"CHANNEL_NOT_AVAILABLE"})",
+                     "CHANNEL_NOT_AVAILABLE"});
+  }
+  {
+    Result r = aidl(CommandKind::Close, "close", "SUCCESS");
+    cases.push_back({r, R"({"cmd":"close","status":"SUCCESS"})", "SUCCESS"});
+  }
+  {
+    Result r = aidl(CommandKind::Present, "present", "SUCCESS");
+    r.error = "connection to the service lost";  // transport errors as for HIDL
+    cases.push_back({r, R"({"cmd":"present","error":"connection to the service lost"})", ""});
+  }
+  for (const Case& c : cases) {
+    EXPECT_EQ(formatJson(c.r), c.json);
+    EXPECT_EQ(formatHuman(c.r), c.human);
+  }
+}
+
+TEST(SecliParse, ResetIsAnAidlCommand) {
+  Options o;
+  std::string message;
+  EXPECT_EQ(parseArgs({"-i", "eSE1", "reset"}, &o, &message), ArgsOutcome::Usage);
+  EXPECT_NE(message.find("--aidl"), std::string::npos);
+  EXPECT_EQ(parseArgs({"--aidl", "-i", "eSE1", "reset"}, &o, &message), ArgsOutcome::Run);
+  EXPECT_TRUE(o.aidl);
+  EXPECT_EQ(parseArgs({"--aidl", "-i", "eSE1", "reset", "1"}, &o, &message), ArgsOutcome::Usage);
+  EXPECT_EQ(aidlInstanceName("SIM1"), "android.hardware.secure_element.ISecureElement/SIM1");
+  EXPECT_EQ(AidlSession::connect("a/b", 1000), nullptr);
+  EXPECT_NE(mainHelp().find("--aidl"), std::string::npos);
+  EXPECT_NE(mainHelp().find("reset"), std::string::npos);
+}
+
+}  // namespace

@@ -28,13 +28,21 @@ using Events = std::vector<std::string>;
 
 constexpr const char* kTag = "qvese@1.0-service";
 
+std::string aidlName(const std::string& instance) {
+  return "android.hardware.secure_element.ISecureElement/" + instance;
+}
+
 class ServiceStart : public ::testing::Test {
  protected:
   void SetUp() override {
     fake_ese::reset();
-    hooks.registerService = [this](const std::string&, const std::string& name,
+    hooks.registerService = [this](const std::string& descriptor, const std::string& name,
                                    const sp<IBase>& service) -> status_t {
       events.push_back("register " + name + " type=" + std::to_string(g_korva_exist));
+      // AIDL instances go by their interface's full name.
+      if (name.find('/') != std::string::npos) {
+        EXPECT_EQ(name.rfind(descriptor + "/", 0), 0u);
+      }
       if (name == "eSE1") eseRegistered = dynamic_cast<SecureElement*>(service.get()) != nullptr;
       if (name == "SIM1") {
         auto* s = dynamic_cast<ZerbSimSecureElement*>(service.get());
@@ -72,9 +80,12 @@ TEST_F(ServiceStart, TheEseTypeDecidesWhichInstancesAreServed) {
     int32_t type;
     Events events;
   };
+  // The AIDL faces come after the HIDL instances, eSE1 only with an eSE.
   const Events both = {"configure 2 join", "register eSE1 type=", "configure 2 join",
-                       "register SIM1 type=", "join"};
-  const Events simOnly = {"configure 2 join", "register SIM1 type=", "join"};
+                       "register SIM1 type=", "register " + aidlName("eSE1") + " type=",
+                       "register " + aidlName("SIM1") + " type=", "join"};
+  const Events simOnly = {"configure 2 join", "register SIM1 type=",
+                          "register " + aidlName("SIM1") + " type=", "join"};
   const std::vector<Row> rows = {
       {0, simOnly}, {1, both}, {2, both}, {3, simOnly}, {-1, simOnly},
       {INT32_MIN, simOnly}, {INT32_MAX, simOnly},
@@ -107,6 +118,9 @@ TEST_F(ServiceStart, TheEseTypeDecidesWhichInstancesAreServed) {
               hasEse ? ANDROID_LOG_INFO : -1);
     EXPECT_EQ(cap.contains("eSE1", kTag), hasEse);
     EXPECT_EQ(priorityOf("ZerbSimSecureElement Registered sim1 success"), ANDROID_LOG_INFO);
+    EXPECT_EQ(priorityOf("AIDL Registered " + aidlName("eSE1") + " success"),
+              hasEse ? ANDROID_LOG_INFO : -1);
+    EXPECT_EQ(priorityOf("AIDL Registered " + aidlName("SIM1") + " success"), ANDROID_LOG_INFO);
     EXPECT_EQ(eseRegistered, hasEse);
     EXPECT_EQ(simModemId, 0);
   }
@@ -137,6 +151,38 @@ TEST_F(ServiceStart, FailedSimRegistrationEndsWithoutJoining) {
     EXPECT_EQ(events, expected);
     EXPECT_EQ(priorityOf("ZerbSimSecureElement Registered sim1 fail"), ANDROID_LOG_ERROR);
     EXPECT_EQ(priorityOf("ZerbSimSecureElement Registered sim1 success"), -1);
+  }
+}
+
+}  // namespace
+
+namespace {
+
+// A failed AIDL registration ends the process like a HIDL one: no join, and
+// for eSE1 no SIM1 face.
+TEST_F(ServiceStart, FailedAidlRegistrationEndsWithoutJoining) {
+  struct Row {
+    std::string failing;
+    Events tail;  // after the HIDL registrations
+  };
+  const std::vector<Row> rows = {
+      {aidlName("eSE1"), {"register " + aidlName("eSE1") + " type=1"}},
+      {aidlName("SIM1"),
+       {"register " + aidlName("eSE1") + " type=1", "register " + aidlName("SIM1") + " type=1"}},
+  };
+  for (const Row& row : rows) {
+    SCOPED_TRACE(row.failing);
+    events.clear();
+    cap.clear();
+    failures.clear();
+    fake_ese::setEseType(1);
+    failures[row.failing] = ::android::UNKNOWN_ERROR;
+    EXPECT_EQ(qvese_service_main(), 1);
+    Events expected = {"configure 2 join", "register eSE1 type=1", "configure 2 join",
+                       "register SIM1 type=1"};
+    expected.insert(expected.end(), row.tail.begin(), row.tail.end());
+    EXPECT_EQ(events, expected);
+    EXPECT_EQ(priorityOf("AIDL Registered " + row.failing + " fail"), ANDROID_LOG_ERROR);
   }
 }
 
