@@ -41,10 +41,6 @@ CardSession::CardSession(se_card::CardOptions options) : card_(std::move(options
 
 CardSession::Result CardSession::handle(const std::vector<uint8_t>& body) {
   Result r;
-  if (body.empty()) {
-    r.event = "# empty message ignored";
-    return r;
-  }
   if (body.size() == 1) {
     switch (body[0]) {
       case kPowerOff:
@@ -80,8 +76,9 @@ CardSession::Result CardSession::handle(const std::vector<uint8_t>& body) {
       }
     }
   }
-  // A driver sends APDUs only to a powered card; one that comes anyway is
-  // answered, since the driver waits for an answer to every APDU.
+  // Any other body is an APDU, an empty one included: the driver waits for
+  // an answer to each. A driver sends APDUs only to a powered card; one that
+  // comes anyway is answered all the same.
   r.reply = card_.process(body);
   r.event = "< " + hexSpaced(body) + "\n> " + hexSpaced(*r.reply);
   return r;

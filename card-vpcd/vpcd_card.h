@@ -6,7 +6,8 @@
 // Wire format, both ways: a 2-byte big-endian length, then that many bytes.
 // A 1-byte body from the driver is a control code (0 power off, 1 power on,
 // 2 reset, 4 ATR request); only the ATR request is answered (with the ATR).
-// Any longer body is a command APDU, answered with the response APDU.
+// Any other body (an empty one too) is a command APDU, answered with the
+// response APDU.
 #include <cstddef>
 #include <cstdint>
 #include <optional>

@@ -33,6 +33,7 @@ using ese_pcsc::kTag;
 // for a Transceive response (the basic channel's SELECT buffer).
 constexpr size_t kIpcResponseBuffer = 270;
 constexpr size_t kRpduDataBuffer = 256;
+constexpr uint32_t kApduHeader = 4;
 
 std::string propertyText(const char* name) {
   char value[PROPERTY_VALUE_MAX] = {0};
@@ -139,6 +140,14 @@ extern "C" int32_t phQVNciHal_Transmit_APDU_by_IPC(phQvEse_data* cmd, phQvEse_da
   rsp->len = 0;
   if ((cmd->len > 0 && cmd->p_data == nullptr) || rsp->p_data == nullptr) {
     __android_log_print(ANDROID_LOG_ERROR, kTag, "phQVNciHal_Transmit_APDU_by_IPC: null buffer");
+    return -1;
+  }
+  if (cmd->len < kApduHeader) {
+    // No APDU at all; some reader drivers never answer one (vpcd reads a
+    // single byte as a power command and stalls the reader on none).
+    __android_log_print(ANDROID_LOG_ERROR, kTag,
+                        "phQVNciHal_Transmit_APDU_by_IPC: %u-byte command is shorter than an APDU header, not sent",
+                        cmd->len);
     return -1;
   }
   Library& l = library();
