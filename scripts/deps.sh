@@ -1,9 +1,11 @@
 #!/usr/bin/env bash
 # Installs the Debian packages the build needs, when any is missing.
-#   scripts/deps.sh        compilers, CMake and GoogleTest
+#   scripts/deps.sh        compilers, CMake, GoogleTest, and PC/SC: pcscd, its
+#                          client library and the vpcd reader driver
 #   scripts/deps.sh fuzz   also clang and its runtimes (libFuzzer, sanitizers)
 set -euo pipefail
-pkgs=(cmake make g++ libgtest-dev libgmock-dev)
+pkgs=(cmake make g++ libgtest-dev libgmock-dev pcscd libpcsclite-dev vsmartcard-vpcd)
+command -v pkg-config >/dev/null || pkgs+=(pkg-config)
 if [ "${1:-}" = fuzz ]; then
   pkgs+=(clang libclang-rt-14-dev)
 fi
