@@ -52,7 +52,9 @@ PcscLink::~PcscLink() { close(); }
 
 bool PcscLink::establish(const char* who) {
   if (haveContext_) {
-    if (SCardIsValidContext(context_) == SCARD_S_SUCCESS) return true;
+    const LONG valid = SCardIsValidContext(context_);
+    if (valid == SCARD_S_SUCCESS) return true;
+    __android_log_print(ANDROID_LOG_DEBUG, kTag, "SCardIsValidContext: %s; a new context", pcsc_stringify_error(valid));
     release();
   }
   const LONG rv = SCardEstablishContext(SCARD_SCOPE_SYSTEM, nullptr, nullptr, &context_);
@@ -134,7 +136,11 @@ bool PcscLink::connect(const std::string& name) {
   reader_ = name;
   uint8_t atr[MAX_ATR_SIZE];
   DWORD atrLen = sizeof(atr), state = 0, nameLen = 0;
-  if (SCardStatus(card_, nullptr, &nameLen, &state, &protocol, atr, &atrLen) != SCARD_S_SUCCESS) atrLen = 0;
+  const LONG status = SCardStatus(card_, nullptr, &nameLen, &state, &protocol, atr, &atrLen);
+  if (status != SCARD_S_SUCCESS) {
+    __android_log_print(ANDROID_LOG_DEBUG, kTag, "SCardStatus for the ATR: %s", pcsc_stringify_error(status));
+    atrLen = 0;
+  }
   __android_log_print(ANDROID_LOG_INFO, kTag, "phQvEse_init_open: connected to \"%s\", T=%d, ATR %s", name.c_str(),
                       protocolNumber(protocol), hex(atr, atrLen).c_str());
   return true;
@@ -204,7 +210,10 @@ void PcscLink::release() {
 void PcscLink::drop(const char* who, LONG rv) {
   __android_log_print(ANDROID_LOG_ERROR, kTag, "%s on \"%s\": %s; connection dropped, the next init connects again",
                       who, reader_.c_str(), pcsc_stringify_error(rv));
-  SCardDisconnect(card_, SCARD_LEAVE_CARD);
+  const LONG left = SCardDisconnect(card_, SCARD_LEAVE_CARD);
+  if (left != SCARD_S_SUCCESS) {
+    __android_log_print(ANDROID_LOG_DEBUG, kTag, "SCardDisconnect of the lost handle: %s", pcsc_stringify_error(left));
+  }
   connected_ = false;
   release();
 }
