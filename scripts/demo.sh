@@ -8,7 +8,7 @@ cd "$(dirname "$0")/.."
 
 usage() {
   cat <<'EOF'
-usage: scripts/demo.sh [--two-modems] [--keep] [--help]
+usage: scripts/demo.sh [--two-modems] [--pcsc] [--keep] [--help]
 
 Builds the programs when needed, then in a fresh temporary device root:
 writes the properties and the NFC sysfs nodes, starts modem-sim, starts the
@@ -20,6 +20,10 @@ Every process it starts is stopped at the end.
 
   --two-modems  run a second modem-sim (modem 1, another ATR) and show "SIM1"
                 following the NFC SIM switch node to it
+  --pcsc        serve "eSE1" with the PC/SC library (build/lib/pcsc) through
+                pcscd and the virtual card in vpcd's reader (card-vpcd), and
+                pull the card out and put it back; starts pcscd in the
+                foreground when none runs (as root)
   --keep        keep the device root (logs, properties) and print its path
   --help        this text
 
@@ -28,10 +32,12 @@ EOF
 }
 
 two_modems=0
+pcsc=0
 keep=0
 for a in "$@"; do
   case "$a" in
     --two-modems) two_modems=1 ;;
+    --pcsc) pcsc=1 ;;
     --keep) keep=1 ;;
     -h | --help) usage; exit 0 ;;
     *) echo "demo: unknown option '$a'" >&2; usage >&2; exit 2 ;;
@@ -41,9 +47,13 @@ done
 build=${BUILD_DIR:-build}
 bin=$build/bin
 targets=(qvese_service secli modem-sim ese_qv_hal)
+[ "$pcsc" = 1 ] && targets+=(ese_qv_hal_pcsc card-vpcd)
 
 # ---- build, quietly ---------------------------------------------------------
-if [ ! -f "$build/CMakeCache.txt" ]; then
+if [ "$pcsc" = 1 ] && ! command -v pcscd >/dev/null && [ ! -x /usr/sbin/pcscd ]; then
+  scripts/deps.sh || exit 1
+fi
+if [ ! -f "$build/CMakeCache.txt" ] || { [ "$pcsc" = 1 ] && ! grep -q '^PCSCLITE_FOUND:INTERNAL=1' "$build/CMakeCache.txt"; }; then
   echo "demo: first run: building the daemon and the tools into $build (a few minutes)"
   scripts/deps.sh || exit 1
   if ! cmake -S . -B "$build" >"/tmp/se-demo-build.$$.log" 2>&1; then
@@ -198,7 +208,35 @@ if [ "$two_modems" = 1 ]; then
   wait_for "$root/modem1.out" "ready" || exit 1
   echo "modem-sim:   modem 1 on $root/dev/appvcom34 (log: modem1.log)"
 fi
-SE_DEVICE_ROOT=$root "${pd[@]}" "$bin/qvese@1.0-service" 2>"$root/daemon.log" &
+daemon_env=()
+if [ "$pcsc" = 1 ]; then
+  # pcscd: the running one, else our own in the foreground with vpcd's
+  # reader on its default port.
+  vpcd_port=35963
+  reader="Virtual PCD 00 00"
+  if [ -f /run/pcscd/pcscd.pid ] && kill -0 "$(cat /run/pcscd/pcscd.pid)" 2>/dev/null; then
+    echo "pcscd:       already running (pid $(cat /run/pcscd/pcscd.pid)); vpcd expected on port $vpcd_port"
+  else
+    mkdir -p "$root/reader.conf.d"
+    printf 'FRIENDLYNAME "Virtual PCD"\nDEVICENAME /dev/null:%s\nLIBPATH %s\nCHANNELID %s\n' "$vpcd_port" \
+      /usr/lib/pcsc/drivers/serial/libifdvpcd.so "$vpcd_port" >"$root/reader.conf.d/vpcd"
+    pcscd_bin=$(command -v pcscd || echo /usr/sbin/pcscd)
+    "${pd[@]}" "$pcscd_bin" --foreground --info -c "$root/reader.conf.d" >"$root/pcscd.log" 2>&1 &
+    pids+=($!)
+    wait_for "$root/pcscd.log" "daemon ready" || { cat "$root/pcscd.log" >&2; exit 1; }
+    echo "pcscd:       started in the foreground, vpcd reader on port $vpcd_port (log: pcscd.log)"
+  fi
+  "${pd[@]}" "$bin/card-vpcd" --port "$vpcd_port" >"$root/card.out" 2>"$root/card.log" &
+  card_pid=$!
+  pids+=($card_pid)
+  wait_for "$root/card.out" "connected" || exit 1
+  # pcscd has seen the card once it powers it up.
+  wait_for "$root/card.log" "# power on" || exit 1
+  echo "card-vpcd:   the virtual card in \"$reader\" (trace: card.log)"
+  echo "vendor.ese_pcsc.reader=$reader" >>"$root/properties"
+  daemon_env=(LD_LIBRARY_PATH="$build/lib/pcsc")
+fi
+SE_DEVICE_ROOT=$root "${pd[@]}" env "${daemon_env[@]}" "$bin/qvese@1.0-service" 2>"$root/daemon.log" &
 pids+=($!)
 wait_for "$root/daemon.log" "Registered sim1 success" || exit 1
 wait_for "$root/daemon.log" "AIDL Registered android.hardware.secure_element.ISecureElement/SIM1 success" || exit 1
@@ -206,7 +244,11 @@ echo "daemon:      qvese@1.0-service, instances: $("$bin/secli" --root "$root" l
 
 # ---- eSE1 ---------------------------------------------------------------------------
 echo
-echo "== eSE1: the embedded secure element, through the simulated libese_qv_hal.so =="
+if [ "$pcsc" = 1 ]; then
+  echo "== eSE1: a smart card through PC/SC: build/lib/pcsc/libese_qv_hal.so, pcscd, vpcd, card-vpcd =="
+else
+  echo "== eSE1: the embedded secure element, through the simulated libese_qv_hal.so =="
+fi
 session_start eSE1
 step "init: the daemon opens the eSE and reports connected" '^state=true$' init \
   "phQvEse_init_open"
@@ -228,6 +270,34 @@ step "close the other one" '^SUCCESS$' "close $b"
 step "an applet the card does not have" '^NO_SUCH_ELEMENT_ERROR' "open $NONE"
 step "the basic channel to the echo applet" '^SUCCESS select=6F' "basic $ECHO"
 step "an APDU on the basic channel" '^12 34 90 00' "transmit 00 01 00 00 02 12 34"
+if [ "$pcsc" = 1 ]; then
+  step "open the echo applet once more" '^SUCCESS channel=[1-3] select=6F' "open $ECHO"
+  e=$(channel)
+  echo
+  echo "  # the card is pulled out of the reader (card-vpcd stopped)"
+  kill -TERM "$card_pid"
+  wait "$card_pid" 2>/dev/null
+  # pcscd looks at its readers a few times a second; let it see the card gone.
+  if [ -f "$root/pcscd.log" ]; then
+    wait_for "$root/pcscd.log" "Card Removed" || exit 1
+  else
+    sleep 1
+  fi
+  step "an APDU now: the exchange fails, the front answers 1F" '^1F' \
+    "transmit $(cla_of "$e") 01 00 00 01 AA" "SCardTransmit"
+  step "a new channel: the card is not ready, IOERROR" '^IOERROR channel=127' "open $ECHO" "KORVA_READY"
+  echo
+  echo "  # the card is put back (card-vpcd started again)"
+  : >"$root/card.log"
+  "${pd[@]}" "$bin/card-vpcd" --port "$vpcd_port" >"$root/card.out" 2>"$root/card.log" &
+  card_pid=$!
+  pids+=($card_pid)
+  wait_for "$root/card.log" "# power on" || exit 1
+  step "init again: the library connects to the card anew" '^state=true$' init "connected to"
+  step "the echo applet answers again" '^SUCCESS channel=[1-3] select=6F' "open $ECHO"
+  e=$(channel)
+  step "an APDU on it" '^77 90 00' "transmit $(cla_of "$e") 01 00 00 01 77"
+fi
 session_end
 
 # ---- SIM1 ---------------------------------------------------------------------------

@@ -604,7 +604,9 @@ std::vector<uint8_t> transmitChained(const std::vector<uint8_t>& apdu, const Tra
     resp = step({cla, 0xC0, 0x00, 0x00, resp.back()});
   }
   if (exchanges) *exchanges = sent;
-  if (resp.size() < 2) return {};
+  // A first answer without a status word (eSE1's 1F for a failed exchange)
+  // is shown as it came; one in the middle of a chain fails the whole.
+  if (resp.size() < 2) return joined.empty() ? resp : std::vector<uint8_t>{};
   joined.insert(joined.end(), resp.begin(), resp.end());
   return joined;
 }

@@ -1,0 +1,217 @@
+#include "pcsc_env.h"
+
+#include <gtest/gtest.h>
+
+#include <netinet/in.h>
+#include <signal.h>
+#include <sys/socket.h>
+#include <sys/un.h>
+#include <unistd.h>
+
+#include <chrono>
+#include <cstring>
+#include <filesystem>
+
+namespace se_test {
+
+const char* const kCardVpcd = SE_CARD_VPCD_PATH;
+const char* const kPcscLibDir = SE_PCSC_LIB_DIR;
+
+namespace {
+
+namespace fs = std::filesystem;
+
+constexpr int kDefaultVpcdPort = 35963;
+const char* const kPcscdSocket = "/run/pcscd/pcscd.comm";
+
+std::string findFirst(const std::vector<std::string>& candidates) {
+  for (const std::string& c : candidates) {
+    if (access(c.c_str(), X_OK) == 0 || (c.find(".so") != std::string::npos && access(c.c_str(), R_OK) == 0)) {
+      return c;
+    }
+  }
+  return "";
+}
+
+std::string pcscdPath() { return findFirst({"/usr/sbin/pcscd", "/sbin/pcscd", "/usr/local/sbin/pcscd"}); }
+
+std::string vpcdDriver() {
+  return findFirst({"/usr/lib/pcsc/drivers/serial/libifdvpcd.so", "/usr/local/lib/pcsc/drivers/serial/libifdvpcd.so"});
+}
+
+// A pcscd answers on the machine-wide socket.
+bool pcscdRunning() {
+  const int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+  if (fd < 0) return false;
+  sockaddr_un addr{};
+  addr.sun_family = AF_UNIX;
+  strncpy(addr.sun_path, kPcscdSocket, sizeof(addr.sun_path) - 1);
+  const bool up = connect(fd, reinterpret_cast<sockaddr*>(&addr), sizeof(addr)) == 0;
+  close(fd);
+  return up;
+}
+
+bool bindable(int port) {
+  const int fd = socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
+  sockaddr_in a{};
+  a.sin_family = AF_INET;
+  a.sin_port = htons(static_cast<uint16_t>(port));
+  a.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
+  const bool ok = fd >= 0 && bind(fd, reinterpret_cast<sockaddr*>(&a), sizeof(a)) == 0;
+  if (fd >= 0) close(fd);
+  return ok;
+}
+
+// Two free ports in a row: vpcd listens on the configured port for its
+// first slot and on the next one for its second.
+int freePortPair() {
+  for (int attempt = 0; attempt < 50; ++attempt) {
+    const int fd = socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
+    sockaddr_in a{};
+    a.sin_family = AF_INET;
+    a.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
+    socklen_t len = sizeof(a);
+    int port = 0;
+    if (fd >= 0 && bind(fd, reinterpret_cast<sockaddr*>(&a), sizeof(a)) == 0 &&
+        getsockname(fd, reinterpret_cast<sockaddr*>(&a), &len) == 0) {
+      port = ntohs(a.sin_port);
+    }
+    if (fd >= 0) close(fd);
+    if (port > 0 && port < 65535 && bindable(port) && bindable(port + 1)) return port;
+  }
+  return 0;
+}
+
+// pcscd says it is ready a moment before its socket takes connections, and
+// tells nothing when it does: ask the socket until it answers.
+bool waitSocket(int ms) {
+  const auto deadline = std::chrono::steady_clock::now() + std::chrono::milliseconds(ms);
+  while (!pcscdRunning()) {
+    if (std::chrono::steady_clock::now() > deadline) return false;
+    usleep(2000);
+  }
+  return true;
+}
+
+std::vector<std::string> listReaders(SCARDCONTEXT ctx) {
+  std::vector<std::string> out;
+  DWORD size = 0;
+  if (SCardListReaders(ctx, nullptr, nullptr, &size) != SCARD_S_SUCCESS) return out;
+  std::vector<char> names(size + 1, '\0');
+  if (SCardListReaders(ctx, nullptr, names.data(), &size) != SCARD_S_SUCCESS) return out;
+  for (const char* p = names.data(); *p != '\0'; p += strlen(p) + 1) out.emplace_back(p);
+  return out;
+}
+
+}  // namespace
+
+PcscEnv::~PcscEnv() {
+  if (daemon_) {
+    daemon_->stop(SIGTERM);
+    expectNoSanitizerReport("pcscd", daemon_->out().text() + daemon_->err().text());
+  }
+}
+
+std::string PcscEnv::unavailable() {
+  if (pcscdPath().empty()) return "pcscd is not installed (Debian: pcscd; scripts/deps.sh installs it)";
+  if (vpcdDriver().empty()) return "the vpcd reader driver is not installed (Debian: vsmartcard-vpcd)";
+  return "";
+}
+
+void PcscEnv::startOwn() {
+  port_ = freePortPair();
+  ASSERT_NE(port_, 0) << "no two free TCP ports in a row for vpcd";
+  config_ = std::make_unique<TempRoot>();
+  config_->write("reader.conf.d/vpcd", "FRIENDLYNAME \"Virtual PCD\"\nDEVICENAME /dev/null:" + std::to_string(port_) +
+                                           "\nLIBPATH " + vpcdDriver() + "\nCHANNELID " + std::to_string(port_) + "\n");
+  daemon_ = std::make_unique<Process>(
+      std::vector<std::string>{pcscdPath_, "--foreground", "--info", "-c", config_->at("reader.conf.d")},
+      config_->path());
+  ASSERT_TRUE(daemon_->out().waitFor("daemon ready") && waitSocket(kGenerousMs))
+      << "pcscd did not start:\n" << daemon_->out().text() << daemon_->err().text();
+}
+
+void PcscEnv::start() {
+  pcscdPath_ = pcscdPath();
+  if (!pcscdRunning()) {
+    startOwn();
+    return;
+  }
+  // Someone else's pcscd: usable when it serves vpcd's reader.
+  port_ = kDefaultVpcdPort;
+  SCARDCONTEXT ctx;
+  ASSERT_EQ(SCardEstablishContext(SCARD_SCOPE_SYSTEM, nullptr, nullptr, &ctx), SCARD_S_SUCCESS);
+  const std::vector<std::string> readers = listReaders(ctx);
+  SCardReleaseContext(ctx);
+  bool found = false;
+  for (const std::string& r : readers) found |= r == reader_;
+  ASSERT_TRUE(found) << "a pcscd not started by these tests is running without the reader \"" << reader_
+                     << "\" (vsmartcard-vpcd's /etc/reader.conf.d/vpcd, port " << kDefaultVpcdPort
+                     << "); stop it, or install vsmartcard-vpcd and restart it";
+  ASSERT_TRUE(waitCard(false, 0)) << "\"" << reader_ << "\" already holds a card: another virtual card is connected";
+}
+
+void PcscEnv::stopDaemon() {
+  ASSERT_TRUE(ours());
+  daemon_->stop(SIGTERM);
+  expectNoSanitizerReport("pcscd", daemon_->out().text() + daemon_->err().text());
+  daemon_.reset();
+}
+
+void PcscEnv::restartDaemon() {
+  ASSERT_FALSE(daemon_);
+  ASSERT_TRUE(config_);
+  daemon_ = std::make_unique<Process>(
+      std::vector<std::string>{pcscdPath_, "--foreground", "--info", "-c", config_->at("reader.conf.d")},
+      config_->path());
+  ASSERT_TRUE(daemon_->out().waitFor("daemon ready") && waitSocket(kGenerousMs))
+      << daemon_->out().text() << daemon_->err().text();
+}
+
+bool PcscEnv::waitCard(bool present, int ms) {
+  SCARDCONTEXT ctx;
+  const LONG established = SCardEstablishContext(SCARD_SCOPE_SYSTEM, nullptr, nullptr, &ctx);
+  if (established != SCARD_S_SUCCESS) {
+    ADD_FAILURE() << "SCardEstablishContext: " << pcsc_stringify_error(established);
+    return false;
+  }
+  SCARD_READERSTATE s{};
+  s.szReader = reader_.c_str();
+  s.dwCurrentState = SCARD_STATE_UNAWARE;
+  const auto deadline = std::chrono::steady_clock::now() + std::chrono::milliseconds(ms);
+  bool reached = false;
+  for (;;) {
+    const auto left = std::chrono::duration_cast<std::chrono::milliseconds>(deadline - std::chrono::steady_clock::now());
+    const LONG rv = SCardGetStatusChange(ctx, static_cast<DWORD>(std::max<long>(0, left.count())), &s, 1);
+    if (rv == SCARD_S_SUCCESS) {
+      const bool isPresent = (s.dwEventState & SCARD_STATE_PRESENT) != 0;
+      if (isPresent == present) {
+        reached = true;
+        break;
+      }
+      // Wait for the next change from what was seen.
+      s.dwCurrentState = s.dwEventState & ~SCARD_STATE_CHANGED;
+      continue;
+    }
+    break;  // time-out or pcscd gone
+  }
+  SCardReleaseContext(ctx);
+  return reached;
+}
+
+std::unique_ptr<Process> PcscEnv::startCard(const std::vector<std::string>& extra) {
+  std::vector<std::string> argv{kCardVpcd, "--port", std::to_string(port_)};
+  argv.insert(argv.end(), extra.begin(), extra.end());
+  auto card = std::make_unique<Process>(argv, "/");
+  EXPECT_TRUE(card->out().waitFor("connected")) << card->out().text() << card->err().text();
+  EXPECT_TRUE(waitCard(true)) << "pcscd did not see the card in \"" << reader_ << "\"";
+  return card;
+}
+
+void PcscEnv::removeCard(std::unique_ptr<Process>& card) {
+  card->stop(SIGTERM);
+  expectNoSanitizerReport("card-vpcd", card->err().text());
+  EXPECT_TRUE(waitCard(false)) << "pcscd still sees a card in \"" << reader_ << "\"";
+}
+
+}  // namespace se_test
