@@ -287,8 +287,9 @@ Return<SecureElementStatus> ZerbSimSecureElement::closeChannel(uint8_t channelNu
 
 bool ZerbSimSecureElement::isChannelOpen(uint8_t channelNumber) {
   if (channelNumber >= SIM_CHANNEL_MAX) return false;
-  SimLock lock;
-  return g_simOpenedChannels[channelNumber] != 0;
+  // Behind a silent modem the caller's operation could not run anyway.
+  SimLock lock("isChannelOpen");
+  return lock.held() && g_simOpenedChannels[channelNumber] != 0;
 }
 
 void ZerbSimSecureElement::serviceDied(uint64_t, const wp<IBase>&) {
