@@ -21,3 +21,4 @@ void request_get_atr(void) { abort(); }
 void request_open_logical_channel(void) { abort(); }
 void request_close_logical_channel(void) { abort(); }
 void request_transmit_apdu(void) { abort(); }
+void clear_session_table(int32_t) { abort(); }

@@ -183,12 +183,6 @@ int waitForPort(AsyncCmdChannel* ch, int32_t id) {
   }
 }
 
-// The channels of a lost port are gone with it: the modem forgets its
-// sessions when its port goes away.
-void forgetSessions(int32_t id) {
-  for (int32_t& session : sessionTable[id]) session = 0;
-}
-
 // Serves requests until the worker is stopped (false) or its port is lost
 // (true). A request posted before the loss is still run: its AT commands
 // fail at once on the closed port and the caller gets the usual failure.
@@ -334,7 +328,9 @@ void cmdloop(AsyncCmdChannel* channel) {
 
     QV_LOGE("%s[%d] AT port lost, channels closed; reopening", "cmdloop", id);
     at_close();
-    forgetSessions(id);
+    // The channels of a lost port are gone with it: the modem forgets its
+    // sessions when its port goes away.
+    clear_session_table(id);
     fd = waitForPort(channel, id);
     if (fd < 1) break;
   }

@@ -115,3 +115,5 @@ extern int32_t sessionTable[ASYNC_CMD_MODEM_MAX][SESSION_TABLE_SIZE];
 extern int32_t* curSessionTable;
 // Points curSessionTable at the table of the calling worker's modem.
 void adjust_session(void);
+// Forgets every session recorded for the modem.
+void clear_session_table(int32_t modem_id);

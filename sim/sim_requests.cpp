@@ -165,6 +165,11 @@ void adjust_session(void) {
   }
 }
 
+void clear_session_table(int32_t modem_id) {
+  if (modem_id < 0 || modem_id >= ASYNC_CMD_MODEM_MAX) return;
+  for (int32_t& session : sessionTable[modem_id]) session = 0;
+}
+
 void request_get_card_present(void) {
   static const char* const kFn = "request_get_card_present";
   QV_LOGD("%s, enter, g_ulModemId: %d", kFn, static_cast<int32_t>(g_ulModemId));

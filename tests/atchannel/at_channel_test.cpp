@@ -278,21 +278,6 @@ TEST_F(Channel, BareNumberAnswersOnlyWhereAllowed) {
   }
 }
 
-// How long the pending command has gone without an answer line: what the
-// SIM front asks to tell a working modem from a silent one.
-TEST_F(Channel, SilenceOfThePendingCommand) {
-  open([](ScriptedModem& m, const std::string&) {
-    // Answers only once the channel counts the command as silent.
-    ASSERT_TRUE(eventually([] { return at_silence_micros(0) >= 2000; }));
-    m.send("OK\r\n");
-  });
-  EXPECT_EQ(at_silence_micros(0), 0);
-  EXPECT_EQ(at_send_command("AT+X", nullptr), AT_OK);
-  EXPECT_EQ(at_silence_micros(0), 0);
-  EXPECT_EQ(at_silence_micros(1), 0);
-  EXPECT_EQ(at_silence_micros(2), 0);
-}
-
 // A modem that stops reading cannot hold the sender past the command's
 // deadline: the write gives up with a time-out and a log line.
 TEST_F(ChannelWrite, WriteToAModemThatNeverReadsEndsAtTheDeadline) {

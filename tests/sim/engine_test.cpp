@@ -407,7 +407,7 @@ TEST_F(Engine, OpenTakesTheBareSessionId) {
 // A SELECT that timed out leaves no release command behind it: the modem
 // did not answer one command and would hold the lock a third time-out.
 TEST_F(Engine, TimedOutSelectSendsNoRelease) {
-  se_delay::setDivisorForTest(10000);  // 600 s become 60 ms
+  se_delay::setDivisorForTest(1000);  // 600 s become 600 ms
   startWorker(0);
   modem0_->setScript(scriptOf({{"AT+CCHP=", okLine("+CCHP: 257")}, {"AT+CGLA=", ""}}));
   LogCapture cap;

@@ -19,9 +19,8 @@ inline void resetEngine() {
   g_asyncCmd.param = 0;
   g_asyncCmd.datalen = 0;
   for (uint8_t& b : g_asyncCmd.data) b = 0;
-  for (auto& table : sessionTable) {
-    for (int32_t& session : table) session = 0;
-  }
+  clear_session_table(0);
+  clear_session_table(1);
   curSessionTable = sessionTable[0];
   for (int m = 0; m < ASYNC_CMD_MODEM_MAX; m++) {
     atPortOpened[m] = 0;
