@@ -73,6 +73,14 @@ constexpr uint64_t kPortCheckMicros = 1000000;
 int32_t g_workers[ASYNC_CMD_MODEM_MAX];
 pthread_cond_t g_workerGone = PTHREAD_COND_INITIALIZER;
 
+// Whether a started worker's first try at its port has ended (opened, or
+// failed once); guarded by the modem's mutex, signalled on g_firstTry. init
+// waits for it, so that a state reported ready is not followed by calls
+// refused only because the worker had not been scheduled yet.
+int32_t g_firstTryDone[ASYNC_CMD_MODEM_MAX];
+pthread_cond_t g_firstTry;
+constexpr uint64_t kFirstTryMicros = 1000000;
+
 // The workers' timed waits run on the monotonic clock, so that a change of
 // the wall clock neither stretches nor cuts a retry pause.
 bool monotonicRequestConds() {
@@ -83,6 +91,7 @@ bool monotonicRequestConds() {
     pthread_cond_destroy(&ch.req_cond);
     pthread_cond_init(&ch.req_cond, &attr);
   }
+  pthread_cond_init(&g_firstTry, &attr);
   pthread_condattr_destroy(&attr);
   return true;
 }
@@ -125,6 +134,13 @@ bool waitOnChannel(AsyncCmdChannel* ch, const struct timespec& deadline) {
   return pthread_cond_timedwait(&ch->req_cond, &ch->mutex, &deadline) == ETIMEDOUT;
 }
 
+void firstTryEnded(AsyncCmdChannel* ch, int32_t id, bool opened) {
+  ChannelLock lock(*ch);
+  if (opened) atPortOpened[id] = 1;
+  g_firstTryDone[id] = 1;
+  pthread_cond_broadcast(&g_firstTry);
+}
+
 bool running(AsyncCmdChannel* ch) {
   ChannelLock lock(*ch);
   return ch->running != 0;
@@ -147,6 +163,7 @@ int openAtStart(AsyncCmdChannel* ch, int32_t id) {
   int fd = openPort(ch->dev_path);
   QV_LOGI("%s[%d] open[%s] fd: %d, openTryCount: %d", "cmdloop", id, ch->dev_path, fd,
           openTryCount);
+  if (fd < 1) firstTryEnded(ch, id, false);
   // A descriptor 0 counts as failed too: the port never takes stdin's place.
   while (fd < 1) {
     if (fd >= 0) close(fd);
@@ -251,6 +268,7 @@ int32_t init_at_channel(int32_t modem_id) {
     ch.modem_id = modem_id;
     ch.running = 1;
     g_workers[modem_id]++;
+    g_firstTryDone[modem_id] = 0;
   }
   ch.unsol_handler = nullptr;
   ch.timeout_handler = nullptr;
@@ -270,6 +288,13 @@ int32_t init_at_channel(int32_t modem_id) {
     return -1;
   }
   se_delay::sleepMicros(kWorkerStartMicros);
+  {
+    const struct timespec end = deadlineIn(kFirstTryMicros);
+    ChannelLock chLock(ch);
+    while (g_firstTryDone[modem_id] == 0) {
+      if (pthread_cond_timedwait(&g_firstTry, &ch.mutex, &end) == ETIMEDOUT) break;
+    }
+  }
   asyncCmdInited[modem_id] = 1;
   return 0;
 }
@@ -315,13 +340,11 @@ void cmdloop(AsyncCmdChannel* channel) {
   }
 
   for (;;) {
-    if (at_open(fd, channel->unsol_handler, id) != 0) {
+    const bool opened = at_open(fd, channel->unsol_handler, id) == 0;
+    firstTryEnded(channel, id, opened);
+    if (!opened) {
       QV_LOGE("%s, at_open fail", "cmdloop");
       break;
-    }
-    {
-      ChannelLock lock(*channel);
-      atPortOpened[id] = 1;
     }
     at_set_on_timeout(channel->timeout_handler);
     if (!serve(channel, id, havePath)) break;

@@ -11,6 +11,7 @@
 #include <sstream>
 
 #include <atomic>
+#include <chrono>
 #include <future>
 #include <thread>
 
@@ -113,6 +114,19 @@ TEST_F(Engine, InitAtChannelStartsOneWorkerPerModem) {
   EXPECT_EQ(1u, cap.find("asyncCmdInit, devpath: /dev/appvcom18", kTag).size());
   EXPECT_EQ(1u, cap.find("cmdloop[0] > Start...", kTag).size());
   EXPECT_EQ(0, asyncCmdInited[1]);
+}
+
+// A worker scheduled late (here: 100 ms before its first open, five times
+// the start pause) still has its port open when init_at_channel returns, so
+// the ready state the front then reports is not followed by refused calls.
+TEST_F(Engine, InitAtChannelReturnsAfterTheWorkersFirstTry) {
+  se_delay::setDivisorForTest(1);
+  sim_test::setBeforeOpen([](const std::string&, int attempt) {
+    if (attempt == 1) std::this_thread::sleep_for(std::chrono::milliseconds(100));
+  });
+  EXPECT_EQ(0, init_at_channel(0));
+  EXPECT_EQ(1, atPortOpened[0].load());
+  sim_test::setBeforeOpen({});
 }
 
 TEST_F(Engine, PortOpensAtThirdAttempt) {
