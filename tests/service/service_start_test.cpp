@@ -67,23 +67,26 @@ class ServiceStart : public ::testing::Test {
   int simModemId = -1;
 };
 
-TEST_F(ServiceStart, TheEseTypeDecidesWhichInstancesAreServed) {
+TEST_F(ServiceStart, TheEseTypeDecidesWhichInstancesAreServedAndAFailedRegistrationEndsIt) {
   struct Row {
     int32_t type;
-    Events events;
+    std::string failing;  // the instance whose registration fails, or ""
+    std::vector<std::string> tried;  // the instances registered, in order
   };
-  const Events both = {"configure 2 join", "register eSE1 type=", "configure 2 join",
-                       "register SIM1 type=", "join"};
-  const Events simOnly = {"configure 2 join", "register SIM1 type=", "join"};
+  const std::vector<std::string> both = {"eSE1", "SIM1"}, simOnly = {"SIM1"};
   const std::vector<Row> rows = {
-      {0, simOnly}, {1, both}, {2, both}, {3, simOnly}, {-1, simOnly},
-      {INT32_MIN, simOnly}, {INT32_MAX, simOnly},
+      {0, "", simOnly},      {1, "", both},         {2, "", both},         {3, "", simOnly},
+      {-1, "", simOnly},     {INT32_MIN, "", simOnly}, {INT32_MAX, "", simOnly},
+      // A failed eSE registration builds no SIM instance; neither failure joins.
+      {1, "eSE1", {"eSE1"}}, {1, "SIM1", both},     {0, "SIM1", simOnly},
   };
   for (const auto& row : rows) {
-    SCOPED_TRACE(row.type);
+    SCOPED_TRACE(std::to_string(row.type) + " " + row.failing);
     fake_ese::reset();
     events.clear();
     cap.clear();
+    failures.clear();
+    if (!row.failing.empty()) failures[row.failing] = ::android::UNKNOWN_ERROR;
     eseRegistered = false;
     simModemId = -1;
     g_korva_exist = 12345;
@@ -92,9 +95,12 @@ TEST_F(ServiceStart, TheEseTypeDecidesWhichInstancesAreServed) {
     EXPECT_EQ(qvese_service_main(), 1);
 
     // The type is stored before anything is registered.
-    Events expected = row.events;
-    for (auto& e : expected)
-      if (e.rfind("register", 0) == 0) e += std::to_string(row.type);
+    Events expected;
+    for (const auto& name : row.tried) {
+      expected.push_back("configure 2 join");
+      expected.push_back("register " + name + " type=" + std::to_string(row.type));
+    }
+    if (row.failing.empty()) expected.push_back("join");
     EXPECT_EQ(events, expected);
     EXPECT_EQ(g_korva_exist, row.type);
     // The only library call of the start-up is the type query.
@@ -102,41 +108,22 @@ TEST_F(ServiceStart, TheEseTypeDecidesWhichInstancesAreServed) {
 
     EXPECT_EQ(priorityOf("ecure Element HAL Service 1.0 is starting"), ANDROID_LOG_INFO);
     EXPECT_EQ(priorityOf("g_ese_type = " + std::to_string(row.type) + "!"), ANDROID_LOG_ERROR);
-    const bool hasEse = row.type == 1 || row.type == 2;
-    EXPECT_EQ(priorityOf("SecureElement Registered eSE1 success"),
-              hasEse ? ANDROID_LOG_INFO : -1);
-    EXPECT_EQ(cap.contains("eSE1", kTag), hasEse);
-    EXPECT_EQ(priorityOf("ZerbSimSecureElement Registered sim1 success"), ANDROID_LOG_INFO);
-    EXPECT_EQ(eseRegistered, hasEse);
-    EXPECT_EQ(simModemId, 0);
-  }
-}
-
-TEST_F(ServiceStart, FailedEseRegistrationRegistersNoSim) {
-  fake_ese::setEseType(1);
-  failures["eSE1"] = ::android::UNKNOWN_ERROR;
-  EXPECT_EQ(qvese_service_main(), 1);
-  EXPECT_EQ(events, (Events{"configure 2 join", "register eSE1 type=1"}));
-  EXPECT_EQ(priorityOf("SecureElement Registered eSE1 fail"), ANDROID_LOG_ERROR);
-  EXPECT_EQ(priorityOf("SecureElement Registered eSE1 success"), -1);
-  // The SIM instance was never even built.
-  EXPECT_FALSE(cap.contains("modemid", "ZerbSimSecureElement"));
-}
-
-TEST_F(ServiceStart, FailedSimRegistrationEndsWithoutJoining) {
-  for (int32_t type : {1, 0}) {
-    SCOPED_TRACE(type);
-    events.clear();
-    cap.clear();
-    fake_ese::setEseType(type);
-    failures["SIM1"] = -1;
-    EXPECT_EQ(qvese_service_main(), 1);
-    Events expected = {"configure 2 join", "register SIM1 type=" + std::to_string(type)};
-    if (type == 1)
-      expected.insert(expected.begin(), {"configure 2 join", "register eSE1 type=1"});
-    EXPECT_EQ(events, expected);
-    EXPECT_EQ(priorityOf("ZerbSimSecureElement Registered sim1 fail"), ANDROID_LOG_ERROR);
-    EXPECT_EQ(priorityOf("ZerbSimSecureElement Registered sim1 success"), -1);
+    const bool ese = row.tried.front() == "eSE1", sim = row.tried.back() == "SIM1";
+    const auto outcome = [&](const std::string& name, bool tried, bool success) -> int {
+      if (!tried || (row.failing == name) == success) return -1;
+      return success ? ANDROID_LOG_INFO : ANDROID_LOG_ERROR;
+    };
+    for (bool success : {true, false}) {
+      const char* word = success ? "success" : "fail";
+      EXPECT_EQ(priorityOf(std::string("SecureElement Registered eSE1 ") + word),
+                outcome("eSE1", ese, success));
+      EXPECT_EQ(priorityOf(std::string("ZerbSimSecureElement Registered sim1 ") + word),
+                outcome("SIM1", sim, success));
+    }
+    EXPECT_EQ(cap.contains("eSE1", kTag), ese);
+    EXPECT_EQ(eseRegistered, ese);
+    EXPECT_EQ(simModemId, sim ? 0 : -1);
+    EXPECT_EQ(cap.contains("modemid", "ZerbSimSecureElement"), sim);  // the SIM instance was built
   }
 }
 
