@@ -185,7 +185,8 @@ TEST_F(EseSimTest, MalformedRecordsAreRefused) {
                       {"data but no buffer for it", 0, 256, false}};
   for (const Row& row : rows) {
     uint8_t buf[256];
-    phQvEse_7816_cpdu c{0x00, 0xA4, 0x04, 0x00, row.lc, 0, nullptr, static_cast<uint8_t>(row.le ? 1 : 0), row.le};
+    phQvEse_7816_cpdu c{0x00, 0xA4, 0x04, 0x00, row.lc, 0, nullptr,
+                        static_cast<uint8_t>(row.le ? 1 : 0), row.le};
     phQvEse_7816_rpdu r{};
     r.pdata = row.buffer ? buf : nullptr;
     EXPECT_NE(phQvEse_7816_Transceive(&c, &r), 0) << row.what;
