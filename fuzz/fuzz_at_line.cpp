@@ -1,17 +1,11 @@
 // The port reader's line cutter and classifier over arbitrary byte streams
 // cut into arbitrary read sizes: over-long lines, prompts, NULs, CR/LF runs
 // and SMS-type pairs, with and without a command waiting for its answer.
-#include <fuzzer/FuzzedDataProvider.h>
-
-#include <cstdint>
-#include <cstdlib>
-#include <cstring>
-#include <memory>
-#include <string>
-
 #include <at_line.h>
 #include <atchannel.h>
 #include <host/log_capture.h>
+
+#include "fuzz_util.h"
 
 namespace {
 

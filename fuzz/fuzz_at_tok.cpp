@@ -1,50 +1,35 @@
 // The AT tokenizer over arbitrary response lines: a line is split into a
 // field-kind script and a text, and the fields are taken apart as a handler
 // would, checking that every cursor and token stays inside the line.
-#include <fuzzer/FuzzedDataProvider.h>
-
-#include <cstdint>
-#include <cstdlib>
-#include <cstring>
-#include <string>
-#include <vector>
-
 #include <at_tok.h>
 
-namespace {
-
-bool inside(const char* p, const std::vector<char>& buf) {
-  return p >= buf.data() && p < buf.data() + buf.size();
-}
-
-}  // namespace
+#include "fuzz_util.h"
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
   FuzzedDataProvider in(data, size);
   const uint8_t script = in.ConsumeIntegral<uint8_t>();
   const bool start = in.ConsumeBool();
-  std::string text = in.ConsumeRemainingBytesAsString();
-  // The line as the reader hands it out: a heap copy, NUL-terminated, so
-  // any read past its end is seen by the address sanitizer.
-  std::vector<char> line(text.begin(), text.end());
-  line.push_back('\0');
-  const size_t len = strlen(line.data());
+  const std::string text = in.ConsumeRemainingBytesAsString();
+  // The line as the reader hands it out: a heap copy, NUL-terminated.
+  const std::unique_ptr<char[]> line = fuzz::terminated(text);
+  const size_t len = strlen(line.get());
+  const auto inside = [&](const char* p) { return p >= line.get() && p <= line.get() + text.size(); };
 
-  char* cur = line.data();
+  char* cur = line.get();
   if (start && at_tok_start(&cur) < 0) {
     if (cur != nullptr) abort();  // a failed start leaves no cursor
     return 0;
   }
   // Up to eight fields; the bits of `script` choose int or string.
   for (int i = 0; i < 8 && cur != nullptr; ++i) {
-    if (!inside(cur, line)) abort();
+    if (!inside(cur)) abort();
     if ((script >> i) & 1) {
       int32_t v = 0;
       (void)at_tok_nextint(&cur, &v);
     } else {
       char* s = nullptr;
       if (at_tok_nextstr(&cur, &s) != 0) abort();
-      if (s == nullptr || !inside(s, line)) abort();
+      if (s == nullptr || !inside(s)) abort();
       if (strlen(s) > len) abort();
     }
   }

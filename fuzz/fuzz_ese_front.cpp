@@ -3,19 +3,12 @@
 // a fake linked into this target: it writes at most what the caller's buffer
 // holds but reports whatever length the input chooses, as a faulty library
 // could. A sequence of front operations runs per input.
-#include <fuzzer/FuzzedDataProvider.h>
-
-#include <cstdint>
-#include <cstdlib>
-#include <cstring>
-#include <string>
-#include <vector>
-
 #include <android/hardware/secure_element/1.0/ISecureElement.h>
 #include <host/log_capture.h>
 
 #include "SecureElement.h"
 #include "ese_qv_hal.h"
+#include "fuzz_util.h"
 
 using ::android::sp;
 using ::android::hardware::hidl_death_recipient;
@@ -33,20 +26,11 @@ namespace {
 constexpr size_t kIpcRspBuf = 270;
 constexpr size_t kTransceiveRspBuf = 256;
 
-FuzzedDataProvider* g_in = nullptr;
-volatile uint8_t g_sink;
-
 int32_t rcFrom(FuzzedDataProvider& in) {
   if (in.remaining_bytes() == 0) return -1;
   uint8_t b = in.ConsumeIntegral<uint8_t>();
   if (b < 200) return 0;
   return b < 230 ? -1 : static_cast<int32_t>(b);
-}
-
-// Touches every byte the caller claims to pass, so the sanitizer checks it.
-void readAll(const uint8_t* p, size_t n) {
-  if (n != 0 && p == nullptr) abort();
-  for (size_t i = 0; i < n; ++i) g_sink ^= p[i];
 }
 
 // The reported length: the bytes written, or any value, some beyond the buffer.
@@ -85,21 +69,21 @@ extern "C" {
 int32_t g_korva_exist = 1;
 
 int32_t get_korva_exist_flag(void) { return 1; }
-int32_t phQvEse_init_open(void) { return g_in ? rcFrom(*g_in) : 0; }
+int32_t phQvEse_init_open(void) { return fuzz::input() ? rcFrom(*fuzz::input()) : 0; }
 int32_t phQvEse_close(void) { return 0; }
-int32_t phQVNciHal_Set_KORVA_READY(void) { return g_in ? rcFrom(*g_in) : 0; }
-int32_t phQVNciHal_Get_KORVA_Ready_Status(void) { return g_in ? rcFrom(*g_in) : 0; }
+int32_t phQVNciHal_Set_KORVA_READY(void) { return fuzz::input() ? rcFrom(*fuzz::input()) : 0; }
+int32_t phQVNciHal_Get_KORVA_Ready_Status(void) { return fuzz::input() ? rcFrom(*fuzz::input()) : 0; }
 
 int32_t phQVNciHal_Set_KORVA_Power(const char* state) {
   if (state == nullptr) abort();
-  g_sink ^= static_cast<uint8_t>(strlen(state));
+  fuzz::touch(reinterpret_cast<const uint8_t*>(state), strlen(state));
   return 0;
 }
 
 int32_t phQVNciHal_Transmit_APDU_by_IPC(phQvEse_data* cmd, phQvEse_data* rsp) {
   if (cmd == nullptr || rsp == nullptr || rsp->p_data == nullptr) abort();
-  readAll(cmd->p_data, cmd->len);
-  FuzzedDataProvider& in = *g_in;
+  fuzz::touch(cmd->p_data, cmd->len);
+  FuzzedDataProvider& in = *fuzz::input();
   int32_t rc = rcFrom(in);
   std::vector<uint8_t> b = replyBytes(in, kIpcRspBuf);
   if (!b.empty()) memcpy(rsp->p_data, b.data(), b.size());
@@ -109,8 +93,8 @@ int32_t phQVNciHal_Transmit_APDU_by_IPC(phQvEse_data* cmd, phQvEse_data* rsp) {
 
 int32_t phQvEse_7816_Transceive(phQvEse_7816_cpdu* cpdu, phQvEse_7816_rpdu* rpdu) {
   if (cpdu == nullptr || rpdu == nullptr || rpdu->pdata == nullptr) abort();
-  readAll(cpdu->pdata, cpdu->lc);
-  FuzzedDataProvider& in = *g_in;
+  fuzz::touch(cpdu->pdata, cpdu->lc);
+  FuzzedDataProvider& in = *fuzz::input();
   int32_t rc = rcFrom(in);
   std::vector<uint8_t> b = in.ConsumeBytes<uint8_t>(in.ConsumeIntegralInRange<size_t>(0, kTransceiveRspBuf));
   if (!b.empty()) memcpy(rpdu->pdata, b.data(), b.size());
@@ -125,7 +109,7 @@ int32_t phQvEse_7816_Transceive(phQvEse_7816_cpdu* cpdu, phQvEse_7816_rpdu* rpdu
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
   android::host::LogCapture quiet;
   FuzzedDataProvider in(data, size);
-  g_in = &in;
+  fuzz::CurrentInput current(in);
   static sp<SecureElement> se = new SecureElement();
   sp<Client> client = new Client();
 
@@ -180,6 +164,5 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
         break;
     }
   }
-  g_in = nullptr;
   return 0;
 }

@@ -1,15 +1,7 @@
 // hexDecode over arbitrary text, lengths and output sizes, checked against
 // a plain reference and round-tripped through hexEncode.
-#include <fuzzer/FuzzedDataProvider.h>
-
-#include <cstdint>
-#include <cstdlib>
-#include <cstring>
-#include <memory>
-#include <string>
-#include <vector>
-
 #include "async_cmd.h"
+#include "fuzz_util.h"
 
 namespace {
 
@@ -26,11 +18,8 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
   FuzzedDataProvider in(data, size);
   const size_t outSize = in.ConsumeIntegralInRange<size_t>(0, 300);
   const int32_t extra = in.ConsumeIntegralInRange<int32_t>(-3, 3);
-  std::string text = in.ConsumeRemainingBytesAsString();
-  // Exactly as many characters as the text holds, plus the terminator.
-  std::unique_ptr<char[]> buf(new char[text.size() + 1]);
-  memcpy(buf.get(), text.data(), text.size());
-  buf[text.size()] = '\0';
+  const std::string text = in.ConsumeRemainingBytesAsString();
+  const std::unique_ptr<char[]> buf = fuzz::terminated(text);
   // n may claim fewer characters than there are, never more than the text
   // has (the callers bound it with strnlen), or be negative.
   int32_t n = static_cast<int32_t>(text.size()) + (extra > 0 ? -extra : extra);

@@ -2,14 +2,9 @@
 // the raw input, then the stream decoder on the same bytes cut into chunks
 // the input chooses. Every decoded frame must encode back to the bytes it
 // came from, and no more than one frame may ever be held back.
-#include <fuzzer/FuzzedDataProvider.h>
-
-#include <cstdint>
-#include <cstdlib>
-#include <cstring>
-#include <vector>
-
 #include <host/rpc_wire.h>
+
+#include "fuzz_util.h"
 
 using namespace android::host::rpc;
 

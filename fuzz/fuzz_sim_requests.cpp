@@ -3,22 +3,15 @@
 // only: every command is answered from the fuzz input with a result code, a
 // final line (OK, ERROR, +CME ERROR: n, ...) and intermediate lines, built
 // the way the real channel hands them out (heap copies the caller frees).
-#include <fuzzer/FuzzedDataProvider.h>
-
-#include <cstdint>
-#include <cstdlib>
-#include <cstring>
-#include <string>
-
 #include <at_tok.h>
 #include <atchannel.h>
 #include <host/log_capture.h>
 
 #include "async_cmd.h"
+#include "fuzz_util.h"
 
 namespace {
 
-FuzzedDataProvider* g_in = nullptr;
 int32_t g_acIndex = 0;
 int g_sends = 0;
 
@@ -72,7 +65,7 @@ int32_t answer(const char* command, const char* prefix, ATResponse** out) {
   if (strnlen(command, 1024) >= 1024) abort();
   ++g_sends;
   *out = nullptr;
-  FuzzedDataProvider& in = *g_in;
+  FuzzedDataProvider& in = *fuzz::input();
   static const int32_t kErrors[] = {AT_OK,
                                     AT_ERROR_GENERIC,
                                     AT_ERROR_COMMAND_PENDING,
@@ -148,7 +141,7 @@ int asyncCmdOpenPort(const char*) { abort(); }
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
   android::host::LogCapture quiet;
   FuzzedDataProvider in(data, size);
-  g_in = &in;
+  fuzz::CurrentInput current(in);
   g_sends = 0;
   static const int32_t kIndexes[] = {0, 1, -1};
   g_acIndex = kIndexes[in.ConsumeIntegralInRange<int>(0, 2)];
@@ -193,6 +186,5 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
     if (channel < 1 || channel >= SESSION_TABLE_SIZE) abort();
   }
   g_asyncCmd.state = CMD_STATE_IDLE;
-  g_in = nullptr;
   return 0;
 }

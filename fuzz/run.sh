@@ -42,20 +42,7 @@ run_one() {
   fi
 }
 
-failed=0
-running=0
-pids=()
-for t in "${targets[@]}"; do
-  run_one "$t" &
-  pids+=($!)
-  running=$((running + 1))
-  if [ "$running" -ge "$jobs" ]; then
-    wait -n || failed=1
-    running=$((running - 1))
-  fi
-done
-while [ "$running" -gt 0 ]; do
-  wait -n || failed=1
-  running=$((running - 1))
-done
-exit $failed
+# xargs exits non-zero when any run does.
+export -f run_one
+export build here secs
+printf '%s\n' "${targets[@]}" | xargs -P "$jobs" -I{} bash -c 'run_one "$1"' _ {}

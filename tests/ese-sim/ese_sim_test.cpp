@@ -3,7 +3,6 @@
 
 #include <fcntl.h>
 #include <stdlib.h>
-#include <unistd.h>
 
 #include <condition_variable>
 #include <cstring>
@@ -14,6 +13,7 @@
 #include <sstream>
 #include <string>
 #include <thread>
+#include <tuple>
 #include <vector>
 
 #include "../platform/test_root.h"
@@ -24,220 +24,156 @@ using Bytes = std::vector<uint8_t>;
 
 namespace {
 
+// What an exchange gave: whether it succeeded, and the bytes (IPC: the
+// response; Transceive: the data, then SW1 SW2 from the record).
+using Reply = std::pair<bool, Bytes>;
+Reply ok(Bytes b) { return {true, std::move(b)}; }
+Reply failed(Bytes b = {}) { return {false, std::move(b)}; }
+
+const Bytes kManageOpen = {0x00, 0x70, 0x00, 0x00, 0x01};
+const Bytes kGetData1 = {0x01, 0xCA, 0x00, 0x66, 0x00};  // on channel 1
+
+// The IPC route with a 270-byte buffer, as the daemon gives it.
+Reply ipc(Bytes cmd) {
+  phQvEse_data in{static_cast<uint32_t>(cmd.size()), cmd.empty() ? nullptr : cmd.data()};
+  uint8_t buf[270] = {};
+  phQvEse_data rsp{0, buf};
+  const int32_t rc = phQVNciHal_Transmit_APDU_by_IPC(&in, &rsp);
+  EXPECT_LE(rsp.len, 258u);
+  return {rc == 0, Bytes(buf, buf + std::min<uint32_t>(rsp.len, 270))};
+}
+
+// Transceive into a 256-byte buffer followed by a guard area that must stay
+// untouched. `le` 0: no Le.
+Reply trx(Bytes head, Bytes data, uint32_t le = 256) {
+  phQvEse_7816_cpdu c{head[0], head[1], head[2], head[3], static_cast<uint16_t>(data.size()), 0,
+                      data.empty() ? nullptr : data.data(), static_cast<uint8_t>(le ? 1 : 0),
+                      le ? le : 0x9000};
+  uint8_t buf[256 + 32];
+  memset(buf, 0xEE, sizeof(buf));
+  phQvEse_7816_rpdu r{};
+  r.pdata = buf;
+  r.len = le ? 2 : 0;
+  const int32_t rc = phQvEse_7816_Transceive(&c, &r);
+  for (size_t i = 256; i < sizeof(buf); ++i) EXPECT_EQ(buf[i], 0xEE) << "written past 256 bytes";
+  Bytes out(buf, buf + std::min<uint16_t>(r.len, 256));
+  out.insert(out.end(), {r.sw1, r.sw2});
+  return {rc == 0, out};
+}
+
 class EseSimTest : public ::testing::Test {
  protected:
   void SetUp() override { phQvEse_close(); }  // a closed eSE and a fresh card
   void TearDown() override { phQvEse_close(); }
   // Scripts change a property by appending a line; the last one wins.
   void setProp(const std::string& name, const std::string& value) {
-    root_.appendFile("properties", name + "=" + value + "\n");
+    root_.appendFile("properties", "vendor.ese_sim." + name + "=" + value + "\n");
   }
-
-  // The IPC route with a 270-byte buffer, as the daemon gives it.
-  int32_t ipc(const Bytes& cmd, Bytes& out) {
-    Bytes c = cmd;
-    phQvEse_data in{static_cast<uint32_t>(c.size()), c.empty() ? nullptr : c.data()};
-    uint8_t buf[270];
-    memset(buf, 0, sizeof(buf));
-    phQvEse_data rsp{0, buf};
-    int32_t rc = phQVNciHal_Transmit_APDU_by_IPC(&in, &rsp);
-    EXPECT_LE(rsp.len, 270u);
-    out.assign(buf, buf + std::min<uint32_t>(rsp.len, 270));
-    return rc;
-  }
-
   se_test::TestRoot root_;
 };
-
-struct TransceiveResult {
-  int32_t rc;
-  uint8_t sw1, sw2;
-  Bytes data;
-  bool canaryIntact;
-};
-
-// Transceive into a 256-byte buffer followed by a guard area.
-TransceiveResult transceive(uint8_t cla, uint8_t ins, uint8_t p1, uint8_t p2, Bytes data, bool le,
-                            uint32_t leValue = 256) {
-  phQvEse_7816_cpdu c{};
-  c.cla = cla;
-  c.ins = ins;
-  c.p1 = p1;
-  c.p2 = p2;
-  c.lc = static_cast<uint16_t>(data.size());
-  c.pdata = data.empty() ? nullptr : data.data();
-  c.le_type = le ? 1 : 0;
-  c.le = le ? leValue : 0x9000;
-  uint8_t buf[256 + 32];
-  memset(buf, 0xEE, sizeof(buf));
-  phQvEse_7816_rpdu r{};
-  r.pdata = buf;
-  r.len = le ? 2 : 0;
-  TransceiveResult out{};
-  out.rc = phQvEse_7816_Transceive(&c, &r);
-  out.sw1 = r.sw1;
-  out.sw2 = r.sw2;
-  out.data.assign(buf, buf + std::min<uint16_t>(r.len, 256));
-  out.canaryIntact = true;
-  for (size_t i = 256; i < sizeof(buf); ++i) out.canaryIntact &= buf[i] == 0xEE;
-  return out;
-}
 
 TEST_F(EseSimTest, TypeFromPropertyReadAtEachCall) {
   EXPECT_EQ(get_korva_exist_flag(), 1);
   for (const char* v : {"2", "0", "3", "-1"}) {
-    setProp("vendor.ese_sim.type", v);
+    setProp("type", v);
     EXPECT_EQ(get_korva_exist_flag(), atoi(v));
   }
-  setProp("vendor.ese_sim.type", "two");
+  setProp("type", "two");
   EXPECT_EQ(get_korva_exist_flag(), 1);
 }
 
-TEST_F(EseSimTest, ExchangesFailUntilOpenedAndAfterClose) {
-  Bytes out;
-  EXPECT_NE(ipc({0x00, 0x70, 0x00, 0x00, 0x01}, out), 0);
-  EXPECT_TRUE(out.empty());
-  EXPECT_NE(transceive(0x00, 0xA4, 0x04, 0x00, {}, true).rc, 0);
-
+TEST_F(EseSimTest, ExchangesFailUntilOpenedAndAfterCloseWhichPowerCyclesTheCard) {
+  EXPECT_EQ(ipc(kManageOpen), failed());
+  EXPECT_FALSE(trx({0x00, 0xA4, 0x04, 0x00}, {}).first);
   ASSERT_EQ(phQvEse_init_open(), 0);
-  ASSERT_EQ(ipc({0x00, 0x70, 0x00, 0x00, 0x01}, out), 0);
-  EXPECT_EQ(out, (Bytes{0x01, 0x90, 0x00}));
-  // A second open keeps the card as it is.
-  ASSERT_EQ(phQvEse_init_open(), 0);
-  ASSERT_EQ(ipc({0x01, 0xCA, 0x00, 0x66, 0x00}, out), 0);
-  EXPECT_EQ(out.back(), 0x00);
-  EXPECT_EQ(out[out.size() - 2], 0x90);
-
+  EXPECT_EQ(ipc(kManageOpen), ok({0x01, 0x90, 0x00}));
+  ASSERT_EQ(phQvEse_init_open(), 0);  // a second open keeps the card as it is
+  EXPECT_EQ(ipc(kGetData1).second.size(), 10u);
   phQvEse_close();
-  EXPECT_NE(ipc({0x01, 0xCA, 0x00, 0x66, 0x00}, out), 0);
-  // Closing power-cycled the card: channel 1 is gone.
+  EXPECT_EQ(ipc(kGetData1), failed());
   ASSERT_EQ(phQvEse_init_open(), 0);
-  ASSERT_EQ(ipc({0x01, 0xCA, 0x00, 0x66, 0x00}, out), 0);
-  EXPECT_EQ(out, (Bytes{0x68, 0x81}));
+  EXPECT_EQ(ipc(kGetData1), ok({0x68, 0x81}));  // channel 1 is gone
 }
 
 TEST_F(EseSimTest, FaultSwitchesActAtRunTime) {
   EXPECT_EQ(phQVNciHal_Set_KORVA_READY(), 0);
   EXPECT_EQ(phQVNciHal_Get_KORVA_Ready_Status(), 0);
-  setProp("vendor.ese_sim.fail_ready", "1");
-  setProp("vendor.ese_sim.ready_status", "5");
+  setProp("fail_ready", "1");
+  setProp("ready_status", "5");
   EXPECT_NE(phQVNciHal_Set_KORVA_READY(), 0);
   EXPECT_EQ(phQVNciHal_Get_KORVA_Ready_Status(), 5);
-  setProp("vendor.ese_sim.fail_ready", "0");
+  setProp("fail_ready", "0");
   EXPECT_EQ(phQVNciHal_Set_KORVA_READY(), 0);
 
-  setProp("vendor.ese_sim.fail_open", "true");
+  setProp("fail_open", "true");
   EXPECT_NE(phQvEse_init_open(), 0);
-  setProp("vendor.ese_sim.fail_open", "0");
+  setProp("fail_open", "0");
   ASSERT_EQ(phQvEse_init_open(), 0);
 
-  Bytes out;
-  setProp("vendor.ese_sim.fail_exchange", "1");
-  EXPECT_NE(ipc({0x00, 0x70, 0x00, 0x00, 0x01}, out), 0);
-  EXPECT_TRUE(out.empty());
-  TransceiveResult t = transceive(0x00, 0xA4, 0x04, 0x00, se_card::aid::kEcho, true);
-  EXPECT_NE(t.rc, 0);
-  EXPECT_EQ(t.sw1, 0);
-  EXPECT_EQ(t.sw2, 0);
-  EXPECT_TRUE(t.data.empty());
-
-  setProp("vendor.ese_sim.fail_exchange", "6a82");
-  EXPECT_NE(ipc({0x00, 0x70, 0x00, 0x00, 0x01}, out), 0);
-  EXPECT_EQ(out, (Bytes{0x6A, 0x82}));
-  t = transceive(0x00, 0xA4, 0x04, 0x00, se_card::aid::kEcho, true);
-  EXPECT_NE(t.rc, 0);
-  EXPECT_EQ(t.sw1, 0x6A);
-  EXPECT_EQ(t.sw2, 0x82);
-
-  setProp("vendor.ese_sim.fail_exchange", "0");
-  EXPECT_EQ(ipc({0x00, 0x70, 0x00, 0x00, 0x01}, out), 0);
-  EXPECT_EQ(out, (Bytes{0x01, 0x90, 0x00}));
-  EXPECT_EQ(phQVNciHal_Set_KORVA_Power("korva_poweroff"), 0);
+  // A plain failure leaves no status; a status word given is left in both.
+  setProp("fail_exchange", "1");
+  EXPECT_EQ(ipc(kManageOpen), failed());
+  EXPECT_EQ(trx({0x00, 0xA4, 0x04, 0x00}, se_card::aid::kEcho), failed({0x00, 0x00}));
+  setProp("fail_exchange", "6a82");
+  EXPECT_EQ(ipc(kManageOpen), failed({0x6A, 0x82}));
+  EXPECT_EQ(trx({0x00, 0xA4, 0x04, 0x00}, se_card::aid::kEcho), failed({0x6A, 0x82}));
+  setProp("fail_exchange", "0");
+  EXPECT_EQ(ipc(kManageOpen), ok({0x01, 0x90, 0x00}));
   // The power-off request leaves open channels alone.
-  EXPECT_EQ(ipc({0x01, 0xCA, 0x00, 0x66, 0x00}, out), 0);
-  EXPECT_EQ(out[out.size() - 2], 0x90);
+  EXPECT_EQ(phQVNciHal_Set_KORVA_Power("korva_poweroff"), 0);
+  EXPECT_EQ(ipc(kGetData1).second.size(), 10u);
 }
 
 // The daemon's logical-channel sequence: MANAGE CHANNEL open over IPC, SELECT
 // by Transceive, GET RESPONSE over IPC, MANAGE CHANNEL close by Transceive.
 TEST_F(EseSimTest, LogicalChannelSequenceAsTheDaemonSendsIt) {
   ASSERT_EQ(phQvEse_init_open(), 0);
-  Bytes out;
-  ASSERT_EQ(ipc({0x00, 0x70, 0x00, 0x00, 0x01}, out), 0);
-  ASSERT_EQ(out, (Bytes{0x01, 0x90, 0x00}));
+  ASSERT_EQ(ipc(kManageOpen), ok({0x01, 0x90, 0x00}));
+  Reply sel = trx({0x01, 0xA4, 0x04, 0x00}, se_card::aid::kBig);
+  ASSERT_EQ(sel.second.size(), 2u);  // no data, 61 xx
+  EXPECT_EQ(sel.second[0], 0x61);
+  Reply fci = ipc({0x01, 0xC0, 0x00, 0x00, sel.second[1]});
+  ASSERT_EQ(fci.second.size(), sel.second[1] + 2u);
+  EXPECT_EQ(fci.second[0], 0x6F);
 
-  TransceiveResult sel = transceive(0x01, 0xA4, 0x04, 0x00, se_card::aid::kBig, true);
-  ASSERT_EQ(sel.rc, 0);
-  EXPECT_EQ(sel.sw1, 0x61);
-  EXPECT_TRUE(sel.data.empty());
-  ASSERT_EQ(ipc({0x01, 0xC0, 0x00, 0x00, sel.sw2}, out), 0);
-  ASSERT_EQ(out.size(), sel.sw2 + 2u);
-  EXPECT_EQ(out[0], 0x6F);
-  EXPECT_EQ(Bytes(out.end() - 2, out.end()), (Bytes{0x90, 0x00}));
-
-  sel = transceive(0x01, 0xA4, 0x04, 0x00, se_card::aid::kEcho, true);
-  ASSERT_EQ(sel.rc, 0);
-  EXPECT_EQ(sel.sw1, 0x90);
-  EXPECT_EQ(sel.data[0], 0x6F);
-  ASSERT_EQ(ipc({0x01, 0x01, 0x00, 0x00, 0x02, 0xCA, 0xFE}, out), 0);
-  EXPECT_EQ(out, (Bytes{0xCA, 0xFE, 0x90, 0x00}));
-
-  TransceiveResult close = transceive(0x01, 0x70, 0x80, 0x01, {}, false);
-  EXPECT_EQ(close.rc, 0);
-  EXPECT_EQ(close.sw1, 0x90);
-  EXPECT_EQ(close.sw2, 0x00);
-  EXPECT_TRUE(close.data.empty());
-  EXPECT_EQ(transceive(0x01, 0x70, 0x80, 0x01, {}, false).sw1, 0x68);  // already closed
+  sel = trx({0x01, 0xA4, 0x04, 0x00}, se_card::aid::kEcho);
+  EXPECT_EQ(sel.second.front(), 0x6F);
+  EXPECT_EQ(Bytes(sel.second.end() - 2, sel.second.end()), (Bytes{0x90, 0x00}));
+  EXPECT_EQ(ipc({0x01, 0x01, 0x00, 0x00, 0x02, 0xCA, 0xFE}), ok({0xCA, 0xFE, 0x90, 0x00}));
+  EXPECT_EQ(trx({0x01, 0x70, 0x80, 0x01}, {}, 0), ok({0x90, 0x00}));
+  EXPECT_EQ(trx({0x01, 0x70, 0x80, 0x01}, {}, 0), ok({0x68, 0x81}));  // already closed
 
   // Four channels by default (basic + 3), like the daemon's table.
-  for (uint8_t expect = 1; expect <= 3; ++expect) {
-    ASSERT_EQ(ipc({0x00, 0x70, 0x00, 0x00, 0x01}, out), 0);
-    EXPECT_EQ(out, (Bytes{expect, 0x90, 0x00}));
-  }
-  ASSERT_EQ(ipc({0x00, 0x70, 0x00, 0x00, 0x01}, out), 0);
-  EXPECT_EQ(out, (Bytes{0x6A, 0x81}));
+  for (uint8_t expect = 1; expect <= 3; ++expect) EXPECT_EQ(ipc(kManageOpen), ok({expect, 0x90, 0x00}));
+  EXPECT_EQ(ipc(kManageOpen), ok({0x6A, 0x81}));
 }
 
 TEST_F(EseSimTest, ChannelCountPropertyTakenWhenOpenedFromClosed) {
-  setProp("vendor.ese_sim.channels", "20");
+  setProp("channels", "20");
   ASSERT_EQ(phQvEse_init_open(), 0);
-  Bytes out;
-  for (int i = 0; i < 4; ++i) ASSERT_EQ(ipc({0x00, 0x70, 0x00, 0x00, 0x01}, out), 0);
-  EXPECT_EQ(out, (Bytes{0x04, 0x90, 0x00}));
-  ASSERT_EQ(ipc({0x40, 0xCA, 0x00, 0x66, 0x00}, out), 0);  // channel 4 through CLA 0x40
-  EXPECT_EQ(out[out.size() - 2], 0x90);
+  for (int i = 0; i < 3; ++i) ASSERT_TRUE(ipc(kManageOpen).first);
+  EXPECT_EQ(ipc(kManageOpen), ok({0x04, 0x90, 0x00}));
+  EXPECT_EQ(ipc({0x40, 0xCA, 0x00, 0x66, 0x00}).second.size(), 10u);  // channel 4 through CLA 0x40
 }
 
 TEST_F(EseSimTest, ResponsesStayWithinTheCallersBuffers) {
   ASSERT_EQ(phQvEse_init_open(), 0);
-  ASSERT_EQ(transceive(0x00, 0xA4, 0x04, 0x00, se_card::aid::kBig, true).sw1, 0x61);
-  // 256 data bytes exactly fill the basic channel's SELECT-sized buffer.
-  TransceiveResult t = transceive(0x00, 0x10, 0x01, 0x00, {}, true, 256);
-  ASSERT_EQ(t.rc, 0);
-  EXPECT_EQ(t.data.size(), 256u);
-  EXPECT_EQ(t.data[255], 0xFF);
-  EXPECT_TRUE(t.canaryIntact);
-  // More than one response holds comes as 61 00 with no data.
-  t = transceive(0x00, 0x10, 0x01, 0x2C, {}, true, 256);
-  ASSERT_EQ(t.rc, 0);
-  EXPECT_EQ(t.sw1, 0x61);
-  EXPECT_TRUE(t.data.empty());
-  EXPECT_TRUE(t.canaryIntact);
-
+  ASSERT_EQ(trx({0x00, 0xA4, 0x04, 0x00}, se_card::aid::kBig).second[0], 0x61);
+  // 256 data bytes exactly fill the basic channel's SELECT-sized buffer;
+  // more than one response holds comes as 61 00 with no data.
+  Reply t = trx({0x00, 0x10, 0x01, 0x00}, {});
+  ASSERT_TRUE(t.first);
+  ASSERT_EQ(t.second.size(), 258u);
+  EXPECT_EQ(t.second[255], 0xFF);
+  EXPECT_EQ(trx({0x00, 0x10, 0x01, 0x2C}, {}), ok({0x61, 0x00}));
   // Over IPC: 256 data bytes and SW, never more than 258.
-  Bytes out;
-  ASSERT_EQ(ipc({0x00, 0xC0, 0x00, 0x00, 0x00}, out), 0);
-  EXPECT_EQ(out.size(), 258u);
-  EXPECT_EQ(Bytes(out.end() - 2, out.end()), (Bytes{0x61, 0x2C}));
-  ASSERT_EQ(ipc({0x00, 0xC0, 0x00, 0x00, 0x2C}, out), 0);
-  EXPECT_EQ(out.size(), 0x2Cu + 2);
-
+  Reply r = ipc({0x00, 0xC0, 0x00, 0x00, 0x00});
+  ASSERT_EQ(r.second.size(), 258u);
+  EXPECT_EQ(Bytes(r.second.end() - 2, r.second.end()), (Bytes{0x61, 0x2C}));
+  EXPECT_EQ(ipc({0x00, 0xC0, 0x00, 0x00, 0x2C}).second.size(), 0x2Cu + 2);
   // A command longer than any short APDU, and an empty one.
-  Bytes huge(5000, 0x00);
-  ASSERT_EQ(ipc(huge, out), 0);
-  EXPECT_EQ(out, (Bytes{0x67, 0x00}));
-  ASSERT_EQ(ipc({}, out), 0);
-  EXPECT_EQ(out, (Bytes{0x67, 0x00}));
+  EXPECT_EQ(ipc(Bytes(5000, 0x00)), ok({0x67, 0x00}));
+  EXPECT_EQ(ipc({}), ok({0x67, 0x00}));
 }
 
 TEST_F(EseSimTest, MalformedRecordsAreRefused) {
@@ -245,21 +181,24 @@ TEST_F(EseSimTest, MalformedRecordsAreRefused) {
   EXPECT_NE(phQvEse_7816_Transceive(nullptr, nullptr), 0);
   EXPECT_NE(phQVNciHal_Transmit_APDU_by_IPC(nullptr, nullptr), 0);
   EXPECT_NE(phQVNciHal_Set_KORVA_Power(nullptr), 0);
-  phQvEse_7816_cpdu c{};
-  c.ins = 0xA4;
-  c.p1 = 0x04;
-  c.lc = 6;  // but no data
-  phQvEse_7816_rpdu r{};
-  EXPECT_NE(phQvEse_7816_Transceive(&c, &r), 0);
-  c.lc = 0;
-  c.le_type = 1;
-  c.le = 300;  // no such Le
-  EXPECT_NE(phQvEse_7816_Transceive(&c, &r), 0);
-  // A response with data but no buffer for it.
-  c.le = 256;
-  r.pdata = nullptr;
-  EXPECT_NE(phQvEse_7816_Transceive(&c, &r), 0);
-  EXPECT_EQ(r.len, 0);
+  struct Row {
+    const char* what;
+    uint16_t lc;
+    uint32_t le;
+    bool buffer;
+  };
+  const Row rows[] = {{"Lc without data", 6, 0, true},
+                      {"no such Le", 0, 300, true},
+                      {"data but no buffer for it", 0, 256, false}};
+  for (const Row& row : rows) {
+    uint8_t buf[256];
+    phQvEse_7816_cpdu c{0x00, 0xA4, 0x04, 0x00, row.lc, 0, nullptr,
+                        static_cast<uint8_t>(row.le ? 1 : 0), row.le};
+    phQvEse_7816_rpdu r{};
+    r.pdata = row.buffer ? buf : nullptr;
+    EXPECT_NE(phQvEse_7816_Transceive(&c, &r), 0) << row.what;
+    EXPECT_EQ(r.len, 0) << row.what;
+  }
   uint8_t cmd[5] = {0x00, 0x70, 0x00, 0x00, 0x01};
   phQvEse_data in{5, cmd};
   phQvEse_data out{0, nullptr};
@@ -279,16 +218,12 @@ TEST_F(EseSimTest, OpenAndCloseBesideExchanges) {
     }
   });
   for (int i = 0; i < 400; ++i) {
-    uint8_t cmd[] = {0x00, 0xCA, 0x00, 0x66, 0x00};
-    uint8_t buf[270];
-    memset(buf, 0, sizeof(buf));
-    phQvEse_data in{sizeof(cmd), cmd};
-    phQvEse_data rsp{0, buf};
-    if (phQVNciHal_Transmit_APDU_by_IPC(&in, &rsp) == 0) {
-      ASSERT_EQ(rsp.len, 10u);
-      EXPECT_EQ(buf[8], 0x90);
+    Reply r = ipc({0x00, 0xCA, 0x00, 0x66, 0x00});
+    if (r.first) {
+      ASSERT_EQ(r.second.size(), 10u);
+      EXPECT_EQ(r.second[8], 0x90);
     } else {
-      EXPECT_EQ(rsp.len, 0u);
+      EXPECT_TRUE(r.second.empty());
     }
   }
   opener.join();

@@ -7,9 +7,10 @@
 #include <fcntl.h>
 #include <unistd.h>
 
+#include <cstring>
 #include <fstream>
 
-#include "rpc_test_util.h"
+#include "test_root.h"
 
 namespace {
 
@@ -23,10 +24,7 @@ std::string get(const char* key, const char* def = "dflt") {
 
 class PropertiesTest : public ::testing::Test {
  protected:
-  void write(const std::string& text, bool append = false) {
-    std::ofstream(root.path() + "/properties", append ? std::ios::app : std::ios::trunc) << text;
-  }
-  fake::TempRoot root;
+  se_test::TestRoot root;
 };
 
 TEST_F(PropertiesTest, NoFileMeansDefault) {
@@ -36,18 +34,19 @@ TEST_F(PropertiesTest, NoFileMeansDefault) {
 
 TEST_F(PropertiesTest, FileRules) {
   std::string longValue(120, 'v');
-  write("# ro.a=commented\n"
-        "\n"
-        "   \n"
-        "ro.a=1\n"
-        "ro.ab=prefix-of-another-name\n"
-        "  # indented comment ro.b=2\n"
-        "ro.a=2\r\n"
-        "ro.long=" + longValue + "\n"
-        "no equals sign\n"
-        "ro.empty=\n"
-        "ro.eq=a=b\n"
-        "ro.last=no newline at end");
+  root.writeFile("properties",
+                 "# ro.a=commented\n"
+                 "\n"
+                 "   \n"
+                 "ro.a=1\n"
+                 "ro.ab=prefix-of-another-name\n"
+                 "  # indented comment ro.b=2\n"
+                 "ro.a=2\r\n"
+                 "ro.long=" + longValue + "\n"
+                 "no equals sign\n"
+                 "ro.empty=\n"
+                 "ro.eq=a=b\n"
+                 "ro.last=no newline at end");
   struct Case {
     const char* key;
     std::string want;
@@ -65,7 +64,7 @@ TEST_F(PropertiesTest, FileRules) {
   };
   for (const Case& c : cases) EXPECT_EQ(get(c.key), c.want) << c.key;
   // Read afresh: an appended line takes effect at once.
-  write("\nro.a=3\n", true);
+  root.appendFile("properties", "\nro.a=3\n");
   EXPECT_EQ(get("ro.a"), "3");
   // A default longer than a value is cut the same way.
   EXPECT_EQ(get("ro.none", longValue.c_str()), std::string(91, 'v'));
@@ -96,9 +95,8 @@ TEST(DeviceRoot, MapsAbsolutePathsUnderTheRoot) {
 }
 
 TEST(DeviceRoot, OpenResolvesUnderTheRoot) {
-  fake::TempRoot root;
-  mkdir((root.path() + "/dev").c_str(), 0755);
-  std::ofstream(root.path() + "/dev/appvcom18") << "AT";
+  se_test::TestRoot root;  // dev/ made
+  root.writeFile("dev/appvcom18", "AT");
   int fd = open("/dev/appvcom18", O_RDONLY);
   ASSERT_GE(fd, 0);
   char buf[4] = {};

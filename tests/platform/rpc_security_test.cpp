@@ -26,8 +26,6 @@ extern "C" size_t __sanitizer_get_current_allocated_bytes(void);
 namespace {
 
 using namespace fake;
-using ::android::host::rpc::encodeFrame;
-using ::android::host::rpc::Frame;
 using ::android::host::rpc::FrameKind;
 using ::android::host::rpc::kHeaderSize;
 using ::android::host::rpc::kMaxBodySize;
@@ -65,13 +63,7 @@ bool stillOpenAndQuiet(int fd) {
 
 // A transmit call's header claiming `bodyLength` bytes.
 std::vector<uint8_t> headerClaiming(uint32_t bodyLength) {
-  Frame f;
-  f.kind = FrameKind::Call;
-  f.id = 1;
-  f.object = 0;
-  f.code = 4;
-  std::vector<uint8_t> out;
-  encodeFrame(f, &out);
+  std::vector<uint8_t> out = frameBytes(FrameKind::Call, 1, 0, 4, {});
   for (int i = 0; i < 4; ++i) out[20 + i] = static_cast<uint8_t>(bodyLength >> (8 * i));
   return out;
 }
@@ -86,22 +78,6 @@ bool sendAll(int fd, const std::vector<uint8_t>& bytes) {
   return true;
 }
 
-class Fds {
- public:
-  ~Fds() {
-    for (int fd : mFds) close(fd);
-  }
-  void add(int fd) { mFds.push_back(fd); }
-  const std::vector<int>& all() const { return mFds; }
-  void closeAll() {
-    for (int fd : mFds) close(fd);
-    mFds.clear();
-  }
-
- private:
-  std::vector<int> mFds;
-};
-
 class RpcSecurityTest : public ::testing::Test {
  protected:
   void SetUp() override {
@@ -113,8 +89,19 @@ class RpcSecurityTest : public ::testing::Test {
     ::android::host::setCallTimeout(client, kLimitMs);
   }
   void TearDown() override {
+    closeRaw();
     client = nullptr;
     if (server) server->stop();
+  }
+  // A bare connection, closed by closeRaw() or at the end of the test.
+  int raw() {
+    int fd = connectRaw("SIM1");
+    if (fd >= 0) rawFds.push_back(fd);
+    return fd;
+  }
+  void closeRaw() {
+    for (int fd : rawFds) close(fd);
+    rawFds.clear();
   }
   // The well-behaved client gets its echo within the limit.
   bool served(uint8_t tag) {
@@ -126,6 +113,7 @@ class RpcSecurityTest : public ::testing::Test {
   sp<FakeSecureElement> se = new FakeSecureElement();
   std::unique_ptr<Server> server;
   sp<ISecureElement> client;
+  std::vector<int> rawFds;
 };
 
 TEST_F(RpcSecurityTest, HugeLengthClaimsAreRefusedWithoutAllocating) {
@@ -138,13 +126,13 @@ TEST_F(RpcSecurityTest, HugeLengthClaimsAreRefusedWithoutAllocating) {
   for (int round = 0; round < 16; ++round) {
     for (uint32_t claim : claims) {
       SCOPED_TRACE(claim);
-      int fd = connectRaw("SIM1");
+      int fd = raw();
       ASSERT_GE(fd, 0);
       // The header alone: the refusal may not wait for a body.
       ASSERT_TRUE(sendAll(fd, headerClaiming(claim)));
       EXPECT_TRUE(closedWithoutAnswer(fd));
-      close(fd);
     }
+    closeRaw();
   }
   EXPECT_TRUE(served(2));
   EXPECT_LT(growth(before), 256 * 1024);
@@ -154,18 +142,15 @@ TEST_F(RpcSecurityTest, StalledClientsHoldNeitherThePoolThreadNorMoreThanAFrameE
   ASSERT_TRUE(served(1));
   const size_t before = heapInUse();
   constexpr int kEach = 8;
-  Fds silent, halfHeader, almostWhole;
+  // Per round: one silent, one with half a header, one with all but the
+  // last byte of the largest frame allowed.
   for (int i = 0; i < kEach; ++i) {
-    int a = connectRaw("SIM1");
-    int b = connectRaw("SIM1");
-    int c = connectRaw("SIM1");
-    ASSERT_TRUE(a >= 0 && b >= 0 && c >= 0);
-    silent.add(a);
-    halfHeader.add(b);
-    almostWhole.add(c);
+    raw();
+    int b = raw();
+    int c = raw();
+    ASSERT_TRUE(rawFds.size() == 3u * (i + 1) && b >= 0 && c >= 0);
     std::vector<uint8_t> head = headerClaiming(static_cast<uint32_t>(kMaxBodySize));
     ASSERT_TRUE(sendAll(b, std::vector<uint8_t>(head.begin(), head.begin() + kHeaderSize / 2)));
-    // The largest frame allowed, all but its last byte.
     head.resize(kHeaderSize + kMaxBodySize - 1, 0x5A);
     ASSERT_TRUE(sendAll(c, head));
   }
@@ -177,16 +162,12 @@ TEST_F(RpcSecurityTest, StalledClientsHoldNeitherThePoolThreadNorMoreThanAFrameE
   const long bound = kEach * 2 * static_cast<long>(kHeaderSize + kMaxBodySize) + 512 * 1024;
   EXPECT_LT(growth(before), bound);
   // Nobody was answered or dropped for waiting.
-  for (const Fds* set : {&silent, &halfHeader, &almostWhole}) {
-    for (int fd : set->all()) EXPECT_TRUE(stillOpenAndQuiet(fd));
-  }
+  for (int fd : rawFds) EXPECT_TRUE(stillOpenAndQuiet(fd));
 
   // Gone clients leave nothing behind. Two calls in a row: the first is read
   // no earlier than the ends of the closed connections, the second only
   // after the host has dropped them.
-  silent.closeAll();
-  halfHeader.closeAll();
-  almostWhole.closeAll();
+  closeRaw();
   EXPECT_TRUE(served(4));
   EXPECT_TRUE(served(5));
   EXPECT_LT(growth(before), 256 * 1024);
@@ -207,12 +188,8 @@ TEST_F(RpcSecurityTest, ForeignPeersCannotUseUpConnectionSlots) {
   constexpr int kForeign = 300;
   // Everything the child needs is made before the fork: this process runs
   // the host's threads, so the child keeps to plain system calls.
-  Frame f;
-  f.kind = FrameKind::Call;
-  f.id = 1;
-  f.code = 3;  // isCardPresent
-  std::vector<uint8_t> call;
-  ASSERT_TRUE(encodeFrame(f, &call));
+  const std::vector<uint8_t> call = frameBytes(FrameKind::Call, 1, 0, 3, {});  // isCardPresent
+  ASSERT_FALSE(call.empty());
   const std::string path = ::android::host::serviceSocketPath("SIM1");
   sockaddr_un addr{};
   addr.sun_family = AF_UNIX;
