@@ -283,17 +283,17 @@ class EseSimSwitches : public EseSimTest {
     return ss.str();
   }
   Bytes manageOpen() {
-    Bytes out;
-    EXPECT_EQ(ipc({0x00, 0x70, 0x00, 0x00, 0x01}, out), 0);
-    return out;
+    const Reply r = ipc(kManageOpen);
+    EXPECT_TRUE(r.first);
+    return r.second;
   }
 };
 
 // Channels handed out from a chosen number on, and the report of what is open
 // after each change, the closes from the basic channel included.
 TEST_F(EseSimSwitches, MinimumChannelAndOpenChannelReport) {
-  setProp("vendor.ese_sim.channels", "8");
-  setProp("vendor.ese_sim.min_channel", "4");
+  setProp("channels", "8");
+  setProp("min_channel", "4");
   ASSERT_EQ(phQvEse_init_open(), 0);
   EXPECT_EQ(report(), "\n");
   EXPECT_EQ(manageOpen(), (Bytes{0x04, 0x90, 0x00}));
@@ -301,19 +301,18 @@ TEST_F(EseSimSwitches, MinimumChannelAndOpenChannelReport) {
   EXPECT_EQ(manageOpen(), (Bytes{0x05, 0x90, 0x00}));
   EXPECT_EQ(report(), "4 5\n");
   // The new channel answers through its further-interindustry CLA.
-  Bytes out;
-  ASSERT_EQ(ipc({0x41, 0xCA, 0x00, 0x66, 0x00}, out), 0);
-  EXPECT_EQ(out[out.size() - 2], 0x90);
+  const Reply data = ipc({0x41, 0xCA, 0x00, 0x66, 0x00});
+  ASSERT_TRUE(data.first);
+  ASSERT_GE(data.second.size(), 2u);
+  EXPECT_EQ(data.second[data.second.size() - 2], 0x90);
 
-  const TransceiveResult closed = transceive(0x00, 0x70, 0x80, 0x04, {}, false);
-  EXPECT_EQ(closed.rc, 0);
-  EXPECT_EQ(closed.sw1, 0x90);
+  EXPECT_EQ(trx({0x00, 0x70, 0x80, 0x04}, {}, 0), ok({0x90, 0x00}));
   EXPECT_EQ(report(), "5\n");
 
-  setProp("vendor.ese_sim.min_channel", "7");
+  setProp("min_channel", "7");
   EXPECT_EQ(manageOpen(), (Bytes{0x07, 0x90, 0x00}));
   EXPECT_EQ(manageOpen(), (Bytes{0x6A, 0x81}));  // 8 channels: 7 is the last
-  setProp("vendor.ese_sim.min_channel", "");
+  setProp("min_channel", "");
   EXPECT_EQ(manageOpen(), (Bytes{0x01, 0x90, 0x00}));
   EXPECT_EQ(report(), "1 5 7\n");
 
@@ -329,33 +328,33 @@ TEST_F(EseSimSwitches, AHungExchangeReturnsOnceThePropertyIsCleared) {
   };
   const Case cases[] = {
       {"phQVNciHal_Transmit_APDU_by_IPC",
-       [this] {
-         Bytes out;
-         EXPECT_EQ(ipc({0x00, 0xCA, 0x00, 0x66, 0x00}, out), 0);
-         return Bytes(out.end() - 2, out.end());
+       [] {
+         const Reply r = ipc({0x00, 0xCA, 0x00, 0x66, 0x00});
+         EXPECT_TRUE(r.first);
+         return r.second.size() < 2 ? r.second : Bytes(r.second.end() - 2, r.second.end());
        }},
       {"phQvEse_7816_Transceive",
        [] {
-         const TransceiveResult t = transceive(0x00, 0xCA, 0x00, 0x66, {}, true);
-         EXPECT_EQ(t.rc, 0);
-         return Bytes{t.sw1, t.sw2};
+         const Reply r = trx({0x00, 0xCA, 0x00, 0x66}, {});
+         EXPECT_TRUE(r.first);
+         return Bytes(r.second.end() - 2, r.second.end());
        }},
   };
   for (const Case& c : cases) {
     SCOPED_TRACE(c.function);
     StderrTap tap;
-    setProp("vendor.ese_sim.hang_exchange", "1");
+    setProp("hang_exchange", "1");
     std::future<Bytes> call;
     std::future<int32_t> open;
     // Declared after the calls: on an early return it lets them go first.
     const std::shared_ptr<void> unhang(nullptr,
-                                       [this](void*) { setProp("vendor.ese_sim.hang_exchange", "0"); });
+                                       [this](void*) { setProp("hang_exchange", "0"); });
     call = std::async(std::launch::async, c.call);
     ASSERT_TRUE(tap.waitFor(std::string(c.function) + ": hanging (vendor.ese_sim.hang_exchange)"));
     // The library's lock is held: an open waits for the hung call too.
     open = std::async(std::launch::async, [] { return phQvEse_init_open(); });
     EXPECT_EQ(call.wait_for(std::chrono::seconds(0)), std::future_status::timeout);
-    setProp("vendor.ese_sim.hang_exchange", "0");
+    setProp("hang_exchange", "0");
     EXPECT_EQ(call.get(), (Bytes{0x90, 0x00}));
     EXPECT_EQ(open.get(), 0);
     EXPECT_TRUE(tap.waitFor(std::string(c.function) + ": released"));
