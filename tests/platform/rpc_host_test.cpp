@@ -11,7 +11,9 @@
 #include <sys/un.h>
 
 #include <cstring>
+#include <filesystem>
 #include <fstream>
+#include <set>
 
 #include "rpc_test_util.h"
 
@@ -196,6 +198,125 @@ TEST_F(RpcHostTest, PoolOfTwoRunsTwoCallsAtOnceAndTheThirdWaits) {
   for (auto& t : callers) t.join();
   EXPECT_EQ(ok, 3);
   EXPECT_EQ(se->maxRunning(), 2);
+}
+
+// The pool has no reader of its own: a client's answer to a callback must
+// still be read while every pool thread is in a call.
+TEST_F(RpcHostTest, CallbackAnswersAreReadWhileEveryPoolThreadIsBusy) {
+  struct Case {
+    const char* name;
+    size_t threads;
+    bool fromPoolThread;  // init calls back on the last free pool thread
+  };
+  const Case cases[] = {
+      {"one thread, callback from another thread", 1, false},
+      {"two threads, callback from another thread", 2, false},
+      {"two threads, callback from init on the second", 2, true},
+  };
+  for (const Case& c : cases) {
+    SCOPED_TRACE(c.name);
+    se = new FakeSecureElement();
+    se->blockTransmit = true;
+    se->deferStateChange = !c.fromPoolThread;
+    startServer(c.threads);
+    sp<ISecureElement> client = ISecureElement::getService("SIM1");
+    ASSERT_NE(client, nullptr);
+    sp<ClientCallback> cb = new ClientCallback();
+    if (!c.fromPoolThread) {
+      ASSERT_TRUE(client->init(cb).isOk());
+    }
+
+    // Blocked calls hold the pool threads (all of them, or all but one).
+    const size_t blocked = c.fromPoolThread ? c.threads - 1 : c.threads;
+    std::atomic<int> ok{0};
+    std::vector<std::thread> blockers;
+    for (size_t i = 0; i < blocked; ++i) {
+      blockers.emplace_back([&] {
+        sp<ISecureElement> other = ISecureElement::getService("SIM1");
+        if (other != nullptr && other->transmit({0x01}, [](const hidl_vec<uint8_t>&) {}).isOk()) {
+          ++ok;
+        }
+      });
+    }
+    ASSERT_TRUE(se->waitEntered(static_cast<int>(blocked)));
+
+    if (c.fromPoolThread) {
+      // init runs on the one free thread and waits there for the answer.
+      ASSERT_TRUE(client->init(cb).isOk());
+    } else {
+      std::atomic<bool> serviceCallOk{false};
+      std::thread later([&] { serviceCallOk = se->callback()->onStateChange(true).isOk(); });
+      EXPECT_EQ(::android::host::pollIncomingCalls(client, 10000), 1);
+      later.join();
+      EXPECT_TRUE(serviceCallOk);
+    }
+    EXPECT_EQ(cb->states, std::vector<bool>{true});
+
+    se->release(static_cast<int>(blocked));
+    for (auto& t : blockers) t.join();
+    EXPECT_EQ(ok, static_cast<int>(blocked));
+    // Still served afterwards.
+    EXPECT_TRUE(client->isCardPresent().isOk());
+    client = nullptr;
+    server->stop();
+    server.reset();
+  }
+}
+
+// Calls that arrive in one read are not run one after the other by the
+// thread that read them: each gets a pool thread.
+TEST_F(RpcHostTest, CallsReadTogetherRunAtOnce) {
+  se->blockTransmit = true;
+  startServer(2);
+  int fd = connectRaw("SIM1");
+  ASSERT_GE(fd, 0);
+  std::vector<uint8_t> both;
+  for (uint8_t id : {1, 2}) {
+    // transmit of one byte: its length (u32) and the byte
+    std::vector<uint8_t> f = frameBytes(FrameKind::Call, id, 0, 4, {1, 0, 0, 0, id});
+    both.insert(both.end(), f.begin(), f.end());
+  }
+  ASSERT_EQ(send(fd, both.data(), both.size(), MSG_NOSIGNAL), static_cast<ssize_t>(both.size()));
+  EXPECT_TRUE(se->waitEntered(2));
+  EXPECT_EQ(se->maxRunning(), 2);
+  se->release(2);
+
+  ::android::host::rpc::FrameDecoder decoder;
+  std::set<uint32_t> answered;
+  ::android::host::rpc::Frame f;
+  while (answered.size() < 2) {
+    pollfd pfd{fd, POLLIN, 0};
+    ASSERT_EQ(poll(&pfd, 1, 10000), 1);
+    uint8_t buf[256];
+    ssize_t n = recv(fd, buf, sizeof(buf), 0);
+    ASSERT_GT(n, 0);
+    ASSERT_TRUE(decoder.feed(buf, static_cast<size_t>(n)));
+    while (decoder.next(&f)) {
+      EXPECT_EQ(f.kind, FrameKind::Reply);
+      answered.insert(f.id);
+    }
+  }
+  EXPECT_EQ(answered, (std::set<uint32_t>{1, 2}));
+  close(fd);
+}
+
+// The pool's threads are all the host starts: a pool of three is the
+// joining thread and two more, with no thread of its own for reading.
+TEST_F(RpcHostTest, PoolOfThreeStartsTwoThreads) {
+  auto threads = [] {
+    size_t n = 0;
+    for (const auto& e : std::filesystem::directory_iterator("/proc/self/task")) {
+      (void)e;
+      ++n;
+    }
+    return n;
+  };
+  const size_t before = threads();
+  startServer(3);  // the helper joins on a thread of its own
+  sp<ISecureElement> client = ISecureElement::getService("SIM1");
+  ASSERT_NE(client, nullptr);
+  ASSERT_TRUE(client->isCardPresent().isOk());  // the joiner has joined
+  EXPECT_EQ(threads(), before + 3);
 }
 
 TEST_F(RpcHostTest, ClosedConnectionNotifiesLinkedAndNotUnlinkedRecipients) {
