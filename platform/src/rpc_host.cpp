@@ -273,16 +273,14 @@ class ServerConn : public RemotePeer, public std::enable_shared_from_this<Server
 
   // An answer to one of our calls; false when none is waiting for it.
   bool deliverAnswer(Frame&& f) {
-    int wake = -1;
-    {
-      std::lock_guard<std::mutex> g(mLock);
-      auto it = mPending.find(f.id);
-      if (it == mPending.end() || it->second->done) return false;
-      it->second->frame = std::move(f);
-      it->second->done = true;
-      wake = it->second->wakeFd;
-    }
-    poke(wake);
+    std::lock_guard<std::mutex> g(mLock);
+    auto it = mPending.find(f.id);
+    if (it == mPending.end() || it->second->done) return false;
+    it->second->frame = std::move(f);
+    it->second->done = true;
+    // Under the lock: the waiting call closes its descriptor once it sees
+    // the answer.
+    poke(it->second->wakeFd);
     return true;
   }
 
@@ -294,7 +292,6 @@ class ServerConn : public RemotePeer, public std::enable_shared_from_this<Server
     std::vector<DeathLink> links;
     std::map<uint32_t, wp<IBase>> proxies;
     sp<IBase> service;
-    std::vector<int> wakes;
     {
       std::lock_guard<std::mutex> g(mLock);
       mClosed = true;
@@ -302,9 +299,8 @@ class ServerConn : public RemotePeer, public std::enable_shared_from_this<Server
       proxies.swap(mProxies);
       service = mService;
       mService = nullptr;
-      for (auto& p : mPending) wakes.push_back(p.second->wakeFd);
+      for (auto& p : mPending) poke(p.second->wakeFd);
     }
-    for (int w : wakes) poke(w);
     // Unblocks a writer waiting on a full socket before taking its lock.
     shutdown(mFd.get(), SHUT_RDWR);
     std::lock_guard<std::mutex> g(mWriteLock);
