@@ -13,6 +13,7 @@
 #include <cstring>
 #include <filesystem>
 #include <fstream>
+#include <future>
 #include <set>
 
 #include "rpc_test_util.h"
@@ -221,6 +222,8 @@ TEST_F(RpcHostTest, CallbackAnswersAreReadWhileEveryPoolThreadIsBusy) {
     startServer(c.threads);
     sp<ISecureElement> client = ISecureElement::getService("SIM1");
     ASSERT_NE(client, nullptr);
+    // A server that never reads the answer fails the test instead of hanging it.
+    ASSERT_TRUE(::android::host::setCallTimeout(client, 10000));
     sp<ClientCallback> cb = new ClientCallback();
     if (!c.fromPoolThread) {
       ASSERT_TRUE(client->init(cb).isOk());
@@ -240,20 +243,28 @@ TEST_F(RpcHostTest, CallbackAnswersAreReadWhileEveryPoolThreadIsBusy) {
     }
     ASSERT_TRUE(se->waitEntered(static_cast<int>(blocked)));
 
+    std::thread later;
+    std::promise<bool> serviceCall;  // outlives `later`
+    std::future<bool> serviceCallOk = serviceCall.get_future();
     if (c.fromPoolThread) {
       // init runs on the one free thread and waits there for the answer.
-      ASSERT_TRUE(client->init(cb).isOk());
+      EXPECT_TRUE(client->init(cb).isOk());
     } else {
-      std::atomic<bool> serviceCallOk{false};
-      std::thread later([&] { serviceCallOk = se->callback()->onStateChange(true).isOk(); });
+      later = std::thread(
+          [&] { serviceCall.set_value(se->callback()->onStateChange(true).isOk()); });
       EXPECT_EQ(::android::host::pollIncomingCalls(client, 10000), 1);
-      later.join();
-      EXPECT_TRUE(serviceCallOk);
+      // The answer is read though every pool thread is blocked.
+      if (serviceCallOk.wait_for(std::chrono::seconds(10)) == std::future_status::ready) {
+        EXPECT_TRUE(serviceCallOk.get());
+      } else {
+        ADD_FAILURE() << "the answer was not read while the pool was busy";
+      }
     }
     EXPECT_EQ(cb->states, std::vector<bool>{true});
 
     se->release(static_cast<int>(blocked));
     for (auto& t : blockers) t.join();
+    if (later.joinable()) later.join();
     EXPECT_EQ(ok, static_cast<int>(blocked));
     // Still served afterwards.
     EXPECT_TRUE(client->isCardPresent().isOk());
