@@ -311,6 +311,51 @@ TEST_F(RpcHostTest, CallsReadTogetherRunAtOnce) {
   close(fd);
 }
 
+// More calls than a connection may have queued: reading it pauses at the
+// limit and goes on as they finish, so every call is answered.
+TEST_F(RpcHostTest, CallsBeyondTheConnectionsLimitAreAllAnswered) {
+  se->blockTransmit = true;
+  startServer(2);
+  int fd = connectRaw("SIM1");
+  ASSERT_GE(fd, 0);
+  auto sendCalls = [&](uint32_t first, uint32_t count) {
+    std::vector<uint8_t> all;
+    for (uint32_t id = first; id < first + count; ++id) {
+      std::vector<uint8_t> f =
+          frameBytes(FrameKind::Call, id, 0, 4, {1, 0, 0, 0, static_cast<uint8_t>(id)});
+      all.insert(all.end(), f.begin(), f.end());
+    }
+    return send(fd, all.data(), all.size(), MSG_NOSIGNAL) == static_cast<ssize_t>(all.size());
+  };
+  // Two running, the rest queued: the connection is at its limit.
+  ASSERT_TRUE(sendCalls(1, 8));
+  ASSERT_TRUE(se->waitEntered(2));
+  // These can only be read once some of the first have finished.
+  ASSERT_TRUE(sendCalls(9, 12));
+  constexpr uint32_t kCalls = 20;
+  se->release(kCalls);
+
+  ::android::host::rpc::FrameDecoder decoder;
+  std::set<uint32_t> answered;
+  ::android::host::rpc::Frame f;
+  while (answered.size() < kCalls) {
+    pollfd pfd{fd, POLLIN, 0};
+    ASSERT_EQ(poll(&pfd, 1, 10000), 1) << answered.size() << " of " << kCalls << " answered";
+    uint8_t buf[4096];
+    ssize_t n = recv(fd, buf, sizeof(buf), 0);
+    ASSERT_GT(n, 0);
+    ASSERT_TRUE(decoder.feed(buf, static_cast<size_t>(n)));
+    while (decoder.next(&f)) {
+      ASSERT_EQ(f.kind, FrameKind::Reply);
+      // transmit's answer: the byte sent and 90 00
+      EXPECT_EQ(f.body, (std::vector<uint8_t>{3, 0, 0, 0, static_cast<uint8_t>(f.id), 0x90, 0x00}));
+      answered.insert(f.id);
+    }
+  }
+  EXPECT_EQ(se->maxRunning(), 2);
+  close(fd);
+}
+
 // The pool's threads are all the host starts: a pool of three is the
 // joining thread and two more, with no thread of its own for reading.
 TEST_F(RpcHostTest, PoolOfThreeStartsTwoThreads) {
