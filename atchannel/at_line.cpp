@@ -29,6 +29,15 @@ bool startsWithAny(const char* line, const char* const (&table)[N]) {
   return false;
 }
 
+// A line that is nothing but a decimal number.
+bool isBareNumber(const char* line) {
+  if (*line == '\0') return false;
+  for (; *line != '\0'; ++line) {
+    if (*line < '0' || *line > '9') return false;
+  }
+  return true;
+}
+
 char* skipLineEnds(char* p) {
   while (*p == '\r' || *p == '\n') ++p;
   return p;
@@ -169,8 +178,10 @@ AtLineKind at_classify_line(const char* line, int32_t pending, int32_t command_t
   if (!pending) return AT_KIND_UNSOLICITED;
   if (startsWithAny(line, kFinalSuccess)) return AT_KIND_FINAL_SUCCESS;
   if (startsWithAny(line, final_error_prefixes)) return AT_KIND_FINAL_ERROR;
-  if (command_type == at_type_singleline && !has_intermediate && response_prefix != nullptr &&
-      startsWith(line, response_prefix)) {
+  if (has_intermediate) return AT_KIND_UNSOLICITED;
+  const bool prefixed = response_prefix != nullptr && startsWith(line, response_prefix);
+  if (command_type == at_type_singleline && prefixed) return AT_KIND_INTERMEDIATE;
+  if (command_type == at_type_singleline_or_numeric && (prefixed || isBareNumber(line))) {
     return AT_KIND_INTERMEDIATE;
   }
   return AT_KIND_UNSOLICITED;

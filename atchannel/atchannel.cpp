@@ -1,15 +1,17 @@
-// The AT command channel: one context per modem port, a reader thread that
-// sorts the port's lines, and a sender that writes one command at a time
-// and waits for its final response.
+// The AT command channel's contexts and reader: one context per modem port,
+// bound to the thread that opened it, and a reader thread that sorts the
+// port's lines. The sender is in atchannel_send.cpp.
 #include "atchannel.h"
 
 #include <android/log.h>
 #include <errno.h>
+#include <fcntl.h>
 #include <poll.h>
 #include <securec.h>
 #include <sys/eventfd.h>
 #include <unistd.h>
 
+#include <atomic>
 #include <cstdlib>
 #include <cstring>
 #include <ctime>
@@ -23,18 +25,11 @@
 
 namespace {
 
-const char* const kTag = "atchannel";
-
-#define AT_LOGD(...) __android_log_buf_print(LOG_ID_RADIO, ANDROID_LOG_DEBUG, kTag, __VA_ARGS__)
-#define AT_LOGI(...) __android_log_buf_print(LOG_ID_RADIO, ANDROID_LOG_INFO, kTag, __VA_ARGS__)
-#define AT_LOGE(...) __android_log_buf_print(LOG_ID_RADIO, ANDROID_LOG_ERROR, kTag, __VA_ARGS__)
-
-constexpr uint64_t kCommandTimeoutMicros = 600ULL * 1000000ULL;
-constexpr uint64_t kWriteRetryMicros = 1000000ULL;
 // Pause after a zero-byte read before the port is read again.
 constexpr uint64_t kEofRetryMicros = 1000000ULL;
-constexpr int32_t kWriteAttempts = 5;
-constexpr int32_t kModemSlots = 2;
+// How long at_close waits for the port's reader to leave.
+constexpr time_t kReaderLeaveSeconds = 1;
+constexpr int32_t kModemSlots = AT_MODEM_SLOTS;
 
 pthread_key_t ac_key;
 pthread_once_t ac_key_once = PTHREAD_ONCE_INIT;
@@ -44,30 +39,14 @@ pthread_attr_t reader_thread_attrs[kModemSlots];
 bool g_attrInited[kModemSlots];
 pthread_mutex_t g_attrLock = PTHREAD_MUTEX_INITIALIZER;
 
+// Every context ever made (see AtContext::next_made).
+pthread_mutex_t g_registryLock = PTHREAD_MUTEX_INITIALIZER;
+AtContext* g_madeContexts = nullptr;
+
 // The context this thread reads for, when it is a reader thread.
 thread_local AtContext* t_readerOf = nullptr;
 // True while the reader runs the unsolicited handler with command_lock held.
 thread_local bool t_inLockedHandler = false;
-
-class MutexGuard {
- public:
-  explicit MutexGuard(pthread_mutex_t* m, bool take = true) : m_(take ? m : nullptr) {
-    if (m_ != nullptr) pthread_mutex_lock(m_);
-  }
-  ~MutexGuard() {
-    if (m_ != nullptr) pthread_mutex_unlock(m_);
-  }
-  MutexGuard(const MutexGuard&) = delete;
-  MutexGuard& operator=(const MutexGuard&) = delete;
-
- private:
-  pthread_mutex_t* m_;
-};
-
-struct FreeDeleter {
-  void operator()(void* p) const { free(p); }
-};
-using CharBuf = std::unique_ptr<char, FreeDeleter>;
 
 const char* errText(int err, char* buf, size_t len) {
   // GNU strerror_r may return a static text instead of filling buf.
@@ -77,13 +56,6 @@ const char* errText(int err, char* buf, size_t len) {
 void make_key() { g_keyMade = pthread_key_create(&ac_key, nullptr) == 0; }
 
 bool keyReady() { return pthread_once(&ac_key_once, make_key) == 0 && g_keyMade; }
-
-AtContext* getAtContext() {
-  AtContext* ac = nullptr;
-  if (keyReady()) ac = static_cast<AtContext*>(pthread_getspecific(ac_key));
-  if (ac == nullptr) AT_LOGE("%s, m%d ac is NULL", "getAtContext", static_cast<int32_t>(g_ulModemId));
-  return ac;
-}
 
 int32_t currentFd(AtContext* ac) {
   MutexGuard g(&ac->port_lock);
@@ -120,6 +92,7 @@ AtContext* InitializeAtContext(int32_t fd, int32_t index) {
     AtContext* ac = fresh.get();
     ac->index = index;
     ac->fd = -1;  // at_open sets the port once any earlier reader is gone
+    ac->reader_fd = -1;
     at_line_reset(ac->line_buf, &ac->line_cur, &ac->read_end);
     pthread_mutex_init(&ac->command_lock, nullptr);
     pthread_mutex_init(&ac->request_lock, nullptr);
@@ -144,7 +117,9 @@ AtContext* InitializeAtContext(int32_t fd, int32_t index) {
     }
     // Bound to the thread from now on; the record lives until the process
     // ends, since a detached reader may still hold it after at_close.
-    (void)fresh.release();
+    MutexGuard registry(&g_registryLock);
+    ac->next_made = g_madeContexts;
+    g_madeContexts = fresh.release();
   }
   AtContext* ac = getAtContext();
   if (ac == nullptr) AT_LOGE("getAtContext return null pointer!");
@@ -210,6 +185,8 @@ void readerGone(AtContext* ac) {
   }
   AT_LOGI("[m%d][ch:%d] < reader close.\n", ac->index, currentFd(ac));
   MutexGuard g(&ac->port_lock);
+  if (ac->reader_fd >= 0) close(ac->reader_fd);
+  ac->reader_fd = -1;
   ac->reader_running = 0;
   pthread_cond_broadcast(&ac->reader_gone_cond);
   // The record must not be touched after this point: a new at_open may
@@ -235,11 +212,13 @@ void processLine(AtContext* ac, const char* line) {
   switch (kind) {
     case AT_KIND_FINAL_SUCCESS:
     case AT_KIND_FINAL_ERROR:
+      at_note_answer(ac->index);
       r->success = kind == AT_KIND_FINAL_SUCCESS ? 1 : 0;
       r->final_response = strdup(line);
       pthread_cond_signal(&ac->command_cond);
       break;
     case AT_KIND_INTERMEDIATE: {
+      at_note_answer(ac->index);
       auto* node = static_cast<ATResponseLine*>(calloc(1, sizeof(ATResponseLine)));
       char* text = strdup(line);
       if (node == nullptr || text == nullptr) {
@@ -260,7 +239,7 @@ void processLine(AtContext* ac, const char* line) {
 
 int32_t readPort(void* arg, char* dest, int32_t max_len) {
   auto* ac = static_cast<AtContext*>(arg);
-  int32_t n = sync_read(currentFd(ac), dest, max_len);
+  int32_t n = sync_read(ac->reader_fd, dest, max_len);
   if (n > 0) ac->eof_count = 0;
   return n;
 }
@@ -273,100 +252,16 @@ void waitForWake(AtContext* ac, uint64_t micros) {
   (void)rc;  // the caller reads again either way
 }
 
-struct timespec deadlineAfter(uint64_t micros) {
-  struct timespec now;
-  clock_gettime(CLOCK_MONOTONIC, &now);
-  uint64_t nsec = static_cast<uint64_t>(now.tv_nsec) + (micros % 1000000ULL) * 1000ULL;
-  struct timespec t;
-  t.tv_sec = now.tv_sec + static_cast<time_t>(micros / 1000000ULL) +
-             static_cast<time_t>(nsec / 1000000000ULL);
-  t.tv_nsec = static_cast<long>(nsec % 1000000000ULL);
-  return t;
-}
-
-void reverseIntermediates(ATResponse* r) {
-  ATResponseLine* prev = nullptr;
-  ATResponseLine* cur = r->p_intermediates;
-  while (cur != nullptr) {
-    ATResponseLine* next = cur->next;
-    cur->next = prev;
-    prev = cur;
-    cur = next;
-  }
-  r->p_intermediates = prev;
-}
-
-// One write attempt: 0 written, -3 channel closed, -1 failed.
-int32_t writeAttempt(const char* s, size_t len) {
-  AtContext* ac = getAtContext();
-  if (ac == nullptr) {
-    AT_LOGE("getAtContext return null pointer!");
-    return -1;
-  }
-  if (ac->fd < 0 || ac->reader_closed > 0) {
-    AT_LOGE("writeline error,errno:%d", -3);
-    return -3;
-  }
-  const char* word = at_mask_find(s);
-  if (word != nullptr) {
-    AT_LOGI("m%d_%d>AT+%s=***\n", ac->index, ac->fd, word);
-  } else {
-    AT_LOGI("m%d_%d>%s\n", ac->index, ac->fd, s);
-  }
-  size_t size = len + 2;
-  CharBuf buf(static_cast<char*>(calloc(size, 1)));
-  if (!buf) {
-    AT_LOGD("malloc tmp failed\n");
-    return -1;
-  }
-  if (snprintf_s(buf.get(), size, size - 1, "%s\r", s) != static_cast<int>(len + 1)) return -1;
-  size_t done = 0;
-  while (done < len + 1) {
-    ssize_t n = write(ac->fd, buf.get() + done, len + 1 - done);
-    if (n < 0 && errno == EINTR) continue;
-    if (n <= 0) return -1;
-    done += static_cast<size_t>(n);
-  }
-  return 0;
-}
-
-// Writes the command, then waits for the end of its exchange. command_lock
-// and request_lock are held.
-int32_t exchange(AtContext* ac, const char* command, int32_t type, const char* prefix,
-                 ATResponse** out) {
-  if (ac->response != nullptr) return AT_ERROR_COMMAND_PENDING;
-  ac->command_type = type;
-  int32_t err = writeline(command);
-  if (err < 0) return err;
-
-  ac->response_prefix = prefix;
-  ac->response = static_cast<ATResponse*>(calloc(1, sizeof(ATResponse)));
-  if (ac->response == nullptr) return AT_ERROR_GENERIC;
-
-  struct timespec deadline = deadlineAfter(se_delay::scaledMicros(kCommandTimeoutMicros));
-  while (ac->response->final_response == nullptr && ac->reader_closed == 0) {
-    int rc = pthread_cond_timedwait(&ac->command_cond, &ac->command_lock, &deadline);
-    if (rc == ETIMEDOUT) {
-      if (ac->response->final_response == nullptr && ac->reader_closed == 0) {
-        return AT_ERROR_TIMEOUT;
-      }
-      break;
-    }
-  }
-
-  if (out != nullptr) {
-    reverseIntermediates(ac->response);
-    *out = ac->response;
-  } else {
-    at_response_free(ac->response);
-  }
-  ac->response = nullptr;
-  return ac->reader_closed > 0 ? AT_ERROR_CHANNEL_CLOSED : AT_OK;
-}
-
 }  // namespace
 
 // ---- context registry ------------------------------------------------------
+
+AtContext* getAtContext() {
+  AtContext* ac = nullptr;
+  if (keyReady()) ac = static_cast<AtContext*>(pthread_getspecific(ac_key));
+  if (ac == nullptr) AT_LOGE("%s, m%d ac is NULL", "getAtContext", static_cast<int32_t>(g_ulModemId));
+  return ac;
+}
 
 int32_t get_ac_index(void) {
   AtContext* ac = getAtContext();
@@ -395,11 +290,23 @@ int32_t at_open(int32_t fd, AtUnsolHandler h, int32_t index) {
   }
   retirePreviousReader(ac);
 
+  int32_t readerFd = -1;
+  if (fd >= 0) {
+    int flags = fcntl(fd, F_GETFL);
+    if (flags >= 0) (void)fcntl(fd, F_SETFL, flags | O_NONBLOCK);
+    readerFd = fcntl(fd, F_DUPFD_CLOEXEC, 0);
+    if (readerFd < 0) {
+      AT_LOGE("m%d_%d>ReaderLoop create error!", index, fd);
+      close(fd);
+      return -1;
+    }
+  }
   {
     MutexGuard command(&ac->command_lock);
     MutexGuard port(&ac->port_lock);
     ac->index = index;
     ac->fd = fd;
+    ac->reader_fd = readerFd;
   }
   AT_LOGD("at_open = ac->fd=%d,ac->index=%d", fd, index);
   ac->unsol_handler = h;
@@ -425,7 +332,11 @@ int32_t at_open(int32_t fd, AtUnsolHandler h, int32_t index) {
     MutexGuard port(&ac->port_lock);
     ac->reader_running = 1;
     rc = pthread_create(&ac->reader_thread, &reader_thread_attrs[index], readerMain, ac);
-    if (rc != 0) ac->reader_running = 0;
+    if (rc != 0) {
+      ac->reader_running = 0;
+      if (ac->reader_fd >= 0) close(ac->reader_fd);
+      ac->reader_fd = -1;
+    }
   }
   if (rc != 0) {
     AT_LOGE("m%d_%d>ReaderLoop create error!", index, fd);
@@ -446,10 +357,28 @@ void at_close(void) {
   AT_LOGI("m%d_%d>at close.", static_cast<int32_t>(g_ulModemId), ac->index);
   // request_lock stays: a command issued after the close still takes it and
   // must find a valid mutex (it then ends with -3).
-  MutexGuard attrs(&g_attrLock);
-  if (g_attrInited[ac->index]) {
-    pthread_attr_destroy(&reader_thread_attrs[ac->index]);
-    g_attrInited[ac->index] = false;
+  {
+    MutexGuard attrs(&g_attrLock);
+    if (g_attrInited[ac->index]) {
+      pthread_attr_destroy(&reader_thread_attrs[ac->index]);
+      g_attrInited[ac->index] = false;
+    }
+  }
+  // The reader was woken above and leaves at once; waiting for it means a
+  // closed port has no thread left reading or logging for it. The wait is
+  // bounded, so that a driver whose read blocks cannot stall the close; the
+  // reader itself (closing from its handler) cannot wait for its own end.
+  if (t_readerOf != ac) {
+    struct timespec deadline;
+    clock_gettime(CLOCK_REALTIME, &deadline);
+    deadline.tv_sec += kReaderLeaveSeconds;
+    MutexGuard g(&ac->port_lock);
+    while (ac->reader_running != 0) {
+      if (pthread_cond_timedwait(&ac->reader_gone_cond, &ac->port_lock, &deadline) == ETIMEDOUT) {
+        AT_LOGE("m%d_%d>reader still busy after close", static_cast<int32_t>(g_ulModemId), ac->index);
+        break;
+      }
+    }
   }
 }
 
@@ -553,9 +482,8 @@ int32_t sync_read(int32_t fd, char* dest, int32_t max_len) {
     bool portReady = (pfd[0].revents & (POLLIN | POLLHUP | POLLERR)) != 0;
     bool woken = (pfd[1].revents & POLLIN) != 0;
 
-    MutexGuard g(&ac->port_lock);
-    if (ac->fd != fd) {
-      // Closed while we waited: the number may belong to someone else now.
+    if (currentFd(ac) < 0) {
+      // Closed while we waited.
       AT_LOGE("Read FD is invalid\n");
       errno = EBADF;
       return -1;
@@ -569,10 +497,13 @@ int32_t sync_read(int32_t fd, char* dest, int32_t max_len) {
       errno = EBADF;
       return -1;
     }
+    // `fd` is the reader's own duplicate, so no lock is held across the
+    // read: a driver whose read blocks cannot stall get_ac_index or at_close.
     ssize_t n;
     do {
       n = read(fd, dest, static_cast<size_t>(max_len));
     } while (n < 0 && errno == EINTR);
+    if (n < 0 && (errno == EAGAIN || errno == EWOULDBLOCK)) continue;  // nothing after all
     if (n < 0) {
       int saved = errno;
       AT_LOGE("Read error \n");
@@ -583,98 +514,10 @@ int32_t sync_read(int32_t fd, char* dest, int32_t max_len) {
   }
 }
 
-// ---- sender ------------------------------------------------------------------
-
-int32_t writeline(const char* s) {
-  size_t len = strlen(s);
-  for (int32_t attempt = 0; attempt < kWriteAttempts; ++attempt) {
-    int32_t rc = writeAttempt(s, len);
-    if (rc == 0) return AT_OK;
-    if (rc == AT_ERROR_CHANNEL_CLOSED) return AT_ERROR_CHANNEL_CLOSED;
-    AT_LOGE("writeline error,errno:%d", -1);
-    se_delay::sleepMicros(kWriteRetryMicros);
-  }
-  return AT_ERROR_WRITE_FAILED;
+int32_t at_is_closed(void) {
+  if (!keyReady()) return 1;
+  auto* ac = static_cast<AtContext*>(pthread_getspecific(ac_key));
+  if (ac == nullptr) return 1;
+  MutexGuard g(&ac->command_lock);
+  return ac->reader_closed > 0 ? 1 : 0;
 }
-
-int32_t at_send_command_full_nolock(const char* command, int32_t type, const char* responsePrefix,
-                                    ATResponse** pp_outResponse) {
-  AtContext* ac = getAtContext();
-  if (ac == nullptr) {
-    AT_LOGE("getAtContext return null pointer!");
-    return AT_ERROR_GENERIC;
-  }
-  int rc;
-  while ((rc = pthread_mutex_trylock(&ac->request_lock)) != 0) {
-    if (rc != EBUSY) return AT_ERROR_GENERIC;
-    pthread_cond_wait(&ac->request_cond, &ac->command_lock);
-  }
-  int32_t err = exchange(ac, command, type, responsePrefix, pp_outResponse);
-  if (ac->response != nullptr) {
-    at_response_free(ac->response);
-    ac->response = nullptr;
-  }
-  ac->response_prefix = nullptr;
-  pthread_cond_broadcast(&ac->request_cond);
-  pthread_mutex_unlock(&ac->request_lock);
-  return err;
-}
-
-int32_t at_send_command_full(const char* command, int32_t type, const char* responsePrefix,
-                             ATResponse** pp_outResponse) {
-  // Callers release *out on every path; never leave it unset.
-  if (pp_outResponse != nullptr) *pp_outResponse = nullptr;
-  AtContext* ac = getAtContext();
-  if (ac == nullptr) {
-    AT_LOGE("getAtContext return null pointer!");
-    return AT_ERROR_GENERIC;
-  }
-  if (command == nullptr) return AT_ERROR_GENERIC;
-  {
-    MutexGuard g(&ac->port_lock);
-    if (pthread_equal(pthread_self(), ac->reader_thread)) return AT_ERROR_INVALID_THREAD;
-  }
-  int32_t err;
-  {
-    MutexGuard g(&ac->command_lock);
-    err = at_send_command_full_nolock(command, type, responsePrefix, pp_outResponse);
-  }
-  if ((err == AT_ERROR_TIMEOUT || err == AT_ERROR_WRITE_FAILED) && ac->on_timeout != nullptr) {
-    int32_t probe;
-    {
-      MutexGuard g(&ac->command_lock);
-      probe = at_send_command_full_nolock("AT", at_type_none, nullptr, nullptr);
-    }
-    if (probe < 0) {
-      ac->on_timeout();
-      AT_LOGE("m%d_%d< timeout.", static_cast<int32_t>(g_ulModemId), ac->index);
-    }
-  }
-  return err;
-}
-
-int32_t at_send_command(const char* command, ATResponse** pp_outResponse) {
-  return at_send_command_full(command, at_type_none, nullptr, pp_outResponse);
-}
-
-int32_t at_send_command_singleline(const char* command, const char* responsePrefix,
-                                   ATResponse** pp_outResponse) {
-  int32_t err = at_send_command_full(command, at_type_singleline, responsePrefix, pp_outResponse);
-  if (pp_outResponse != nullptr && err == AT_OK && *pp_outResponse != nullptr &&
-      (*pp_outResponse)->success > 0 && (*pp_outResponse)->p_intermediates == nullptr) {
-    at_response_free(*pp_outResponse);
-    *pp_outResponse = nullptr;
-    return AT_ERROR_INVALID_RESPONSE;
-  }
-  return err;
-}
-
-void at_set_on_timeout(AtTimeoutCallback onTimeout) {
-  AtContext* ac = getAtContext();
-  if (ac == nullptr) {
-    AT_LOGE("getAtContext return null pointer!");
-    return;
-  }
-  ac->on_timeout = onTimeout;
-}
-

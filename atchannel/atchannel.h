@@ -25,6 +25,10 @@ typedef void (*AtTimeoutCallback)(void);
 enum ATCommandType {
   at_type_none = 0,
   at_type_singleline = 2,
+  // Like singleline, but a line made only of digits also counts as the
+  // intermediate line: 3GPP TS 27.007 lets a modem answer AT+CCHO with the
+  // bare session id instead of "+CCHO: <id>".
+  at_type_singleline_or_numeric = 3,
 };
 
 // Results of the send operations.
@@ -45,9 +49,24 @@ void at_close(void);
 int32_t at_send_command(const char* command, ATResponse** pp_outResponse);
 int32_t at_send_command_singleline(const char* command, const char* responsePrefix,
                                    ATResponse** pp_outResponse);
+// As at_send_command_singleline, for commands whose answer may also be a
+// bare number on its own line (at_type_singleline_or_numeric).
+int32_t at_send_command_singleline_or_numeric(const char* command, const char* responsePrefix,
+                                              ATResponse** pp_outResponse);
 void at_response_free(ATResponse* p_response);
 void at_set_on_timeout(AtTimeoutCallback onTimeout);
 int32_t at_get_cme_error(const ATResponse* p_response);
 
 // Modem index of the calling thread's context, -1 when it has none.
 int32_t get_ac_index(void);
+
+// 1 when the calling thread's port is closed (at_close ran, or the reader
+// ended because the port failed, hung up or stayed at end of file) or the
+// thread has no port; 0 while it is usable. Logs nothing.
+int32_t at_is_closed(void);
+
+// How long, in microseconds, the command pending on modem `index`'s port
+// has gone without a line of its answer (counted from its write); 0 when no
+// command is pending there. Any thread may ask: the SIM front uses it to
+// tell a modem that is working from one that has gone silent.
+int64_t at_silence_micros(int32_t index);

@@ -11,9 +11,14 @@ int32_t at_send_command(const char*, ATResponse**) { abort(); }
 int32_t at_send_command_singleline(const char*, const char*, ATResponse**) { abort(); }
 void at_response_free(ATResponse*) { abort(); }
 int32_t at_get_cme_error(const ATResponse*) { abort(); }
+int32_t at_send_command_singleline_or_numeric(const char*, const char*, ATResponse**) { abort(); }
 int32_t get_ac_index(void) { abort(); }
+int32_t at_is_closed(void) { abort(); }
+int64_t at_silence_micros(int32_t) { abort(); }
+int asyncCmdOpenPort(const char*) { abort(); }
 void request_get_card_present(void) { abort(); }
 void request_get_atr(void) { abort(); }
 void request_open_logical_channel(void) { abort(); }
 void request_close_logical_channel(void) { abort(); }
 void request_transmit_apdu(void) { abort(); }
+void clear_session_table(int32_t) { abort(); }

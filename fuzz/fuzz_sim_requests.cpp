@@ -124,12 +124,26 @@ int32_t at_send_command_singleline(const char* command, const char* responsePref
   return answer(command, responsePrefix, pp_outResponse);
 }
 
+// The open answer may also be the bare session id.
+int32_t at_send_command_singleline_or_numeric(const char* command, const char* responsePrefix,
+                                              ATResponse** pp_outResponse) {
+  if (responsePrefix == nullptr) abort();
+  if (g_in->remaining_bytes() > 0 && g_in->ConsumeBool()) {
+    int32_t err = answer(command, "", pp_outResponse);
+    return err;
+  }
+  return answer(command, responsePrefix, pp_outResponse);
+}
+
 int32_t get_ac_index(void) { return g_acIndex; }
 
 // The worker's port handling is not reached from the handlers.
 int32_t at_open(int32_t, AtUnsolHandler, int32_t) { abort(); }
 void at_close(void) { abort(); }
 void at_set_on_timeout(AtTimeoutCallback) {}
+int32_t at_is_closed(void) { abort(); }
+int64_t at_silence_micros(int32_t) { return 0; }
+int asyncCmdOpenPort(const char*) { abort(); }
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
   android::host::LogCapture quiet;

@@ -2,12 +2,13 @@
 
 #include <log/log.h>
 #include <securec.h>
-#include <sys/sysinfo.h>
+#include <errno.h>
 
 #include "async_cmd.h"
 #include "modem_select.h"
 #include "se_delay.h"
 #include "se_modem_id.h"
+#include "se_uptime.h"
 
 uint8_t g_simOpenedChannels[SIM_CHANNEL_MAX];
 std::atomic<int32_t> timeflag{-1};
@@ -23,6 +24,13 @@ constexpr const char* kTag = "ZerbSimSecureElement";
 // Settling time the modem needs after boot before the first request.
 constexpr uint64_t kSettleMicros = 1500000;
 constexpr long kSettledUptimeSeconds = 120;
+// How long a SIM call waits for the front's lock while the call holding it
+// has a modem command out with no answer line. A working modem answers an
+// AT command within about 200 ms; half a second without a line means the
+// modem has gone silent, and the waiter gives up so that its RPC thread is
+// free for the eSE and for death notices. While answers keep coming the
+// waiter keeps waiting, however long the holder's exchange takes.
+constexpr int64_t kModemSilenceMicros = 500000;
 }  // namespace
 
 #define SIM_LOGD(...) __android_log_buf_print(LOG_ID_RADIO, ANDROID_LOG_DEBUG, kTag, __VA_ARGS__)
@@ -42,13 +50,50 @@ static ZerbThreadMutex g_simMutex;
 
 namespace {
 
-// Holds g_simMutex for one scope.
+// Takes g_simMutex, waiting only while the holder's modem is working (see
+// kModemSilenceMicros). False, with a log line, when it gave up.
+bool lockUnlessModemSilent(const char* operation) {
+  if (pthread_mutex_trylock(g_simMutex.get()) == 0) return true;
+  const int64_t bound = static_cast<int64_t>(se_delay::scaledMicros(kModemSilenceMicros));
+  for (;;) {
+    int64_t silent = asyncCmdSilenceMicros();
+    if (silent >= bound) {
+      SIM_LOGE("%s, modem silent for %lld ms, SIM busy: call given up", operation,
+               static_cast<long long>(silent / 1000));
+      return false;
+    }
+    // Sleep on the lock until the modem would count as silent; answers
+    // that come meanwhile move that moment on. The deadline is on the
+    // wall clock, as the lock's timed wait wants, and is taken afresh
+    // each round, so a clock change costs at most one round.
+    int64_t wait = bound - silent;
+    struct timespec deadline;
+    clock_gettime(CLOCK_REALTIME, &deadline);
+    int64_t nsec = deadline.tv_nsec + (wait % 1000000) * 1000;
+    deadline.tv_sec += static_cast<time_t>(wait / 1000000 + nsec / 1000000000);
+    deadline.tv_nsec = static_cast<long>(nsec % 1000000000);
+    int rc = pthread_mutex_timedlock(g_simMutex.get(), &deadline);
+    if (rc == 0) return true;
+    if (rc != ETIMEDOUT) {
+      SIM_LOGE("%s, SIM lock failed: %d", operation, rc);
+      return false;
+    }
+  }
+}
+
+// Holds g_simMutex for one scope, when it could be had (see held()).
 class SimLock {
  public:
-  SimLock() { pthread_mutex_lock(g_simMutex.get()); }
-  ~SimLock() { pthread_mutex_unlock(g_simMutex.get()); }
+  explicit SimLock(const char* operation) : held_(lockUnlessModemSilent(operation)) {}
+  ~SimLock() {
+    if (held_) pthread_mutex_unlock(g_simMutex.get());
+  }
   SimLock(const SimLock&) = delete;
   SimLock& operator=(const SimLock&) = delete;
+  bool held() const { return held_; }
+
+ private:
+  const bool held_;
 };
 
 hidl_vec<uint8_t> bytesOf(const uint8_t* data, int32_t count) {
@@ -60,15 +105,15 @@ hidl_vec<uint8_t> bytesOf(const uint8_t* data, int32_t count) {
 
 void settleAfterBoot() {
   if (timeflag == 1) return;
-  struct sysinfo info;
-  if (sysinfo(&info) != 0) {
+  long uptime = 0;
+  if (se_uptime_seconds(&uptime) != 0) {
     SIM_LOGD("Failed to get sysinfo\n");
     se_delay::sleepMicros(kSettleMicros);
     SIM_LOGD("%s, SLEEP 1.5S", "init");
     return;
   }
-  SIM_LOGD("%s, time is %ld", "print_system_boot_time", static_cast<long>(info.uptime));
-  if (info.uptime >= kSettledUptimeSeconds) {
+  SIM_LOGD("%s, time is %ld", "print_system_boot_time", uptime);
+  if (uptime >= kSettledUptimeSeconds) {
     timeflag = 1;
     return;
   }
@@ -87,18 +132,19 @@ ZerbSimSecureElement::~ZerbSimSecureElement() {}
 
 // Picks the modem for this call and makes it current. Called under g_simMutex.
 void ZerbSimSecureElement::selectModem(const char* operation) {
-  m_modem_id = communication_which_modem();
-  if (m_modem_id < 0) {
-    SIM_LOGE("%s, modem_id error: %d", operation, m_modem_id);
-    m_modem_id = 0;
+  int32_t modem = communication_which_modem();
+  if (modem < 0) {
+    SIM_LOGE("%s, modem_id error: %d", operation, modem);
+    modem = 0;
   }
-  SIM_LOGD("%s, modem_id: %d", operation, m_modem_id);
-  g_ulModemId = m_modem_id;
+  m_modem_id = modem;
+  SIM_LOGD("%s, modem_id: %d", operation, modem);
+  g_ulModemId = modem;
 }
 
 Return<void> ZerbSimSecureElement::init(const sp<ISecureElementHalCallback>& clientCallback) {
-  SIM_LOGD("%s, m_modem_id: %d", "init", m_modem_id);
-  g_ulModemId = m_modem_id;
+  SIM_LOGD("%s, m_modem_id: %d", "init", m_modem_id.load());
+  g_ulModemId = m_modem_id.load();
   if (clientCallback == nullptr) {
     SIM_LOGE("%s, clientCallback is NULL", "init");
     return Void();
@@ -106,10 +152,13 @@ Return<void> ZerbSimSecureElement::init(const sp<ISecureElementHalCallback>& cli
   (void)clientCallback->linkToDeath(this, 0);
 
   // Channels 1 and 2 are left alone: the sweep starts at 3.
+  // A silent modem ends the sweep: its closes could not be sent anyway, and
+  // the flags stay for the next init.
   for (uint8_t channel = 3; channel < SIM_CHANNEL_MAX; channel++) {
     bool opened;
     {
-      SimLock lock;
+      SimLock lock("init");
+      if (!lock.held()) break;
       opened = g_simOpenedChannels[channel] != 0;
     }
     if (opened) (void)closeChannel(channel);
@@ -137,11 +186,15 @@ Return<void> ZerbSimSecureElement::init(const sp<ISecureElementHalCallback>& cli
 }
 
 Return<void> ZerbSimSecureElement::getAtr(getAtr_cb _hidl_cb) {
-  SimLock lock;
-  selectModem("getAtr");
+  SimLock lock("getAtr");
   hidl_vec<uint8_t> atr;
+  if (!lock.held()) {
+    _hidl_cb(atr);
+    return Void();
+  }
+  selectModem("getAtr");
   if (asyncCmdPush(m_modem_id, REQUEST_GET_ATR, nullptr, 0) == 0) {
-    SIM_LOGD("%s, now copy data, modem_id: %d", "getAtr", m_modem_id);
+    SIM_LOGD("%s, now copy data, modem_id: %d", "getAtr", m_modem_id.load());
     if (g_asyncCmd.datalen >= 1 && g_asyncCmd.datalen <= ASYNC_CMD_DATA_MAX) atr = bytesOf(g_asyncCmd.data, g_asyncCmd.datalen);
   }
   _hidl_cb(atr);
@@ -149,7 +202,8 @@ Return<void> ZerbSimSecureElement::getAtr(getAtr_cb _hidl_cb) {
 }
 
 Return<bool> ZerbSimSecureElement::isCardPresent() {
-  SimLock lock;
+  SimLock lock("isCardPresent");
+  if (!lock.held()) return false;
   selectModem("isCardPresent");
   bool present = false;
   if (asyncCmdPush(m_modem_id, REQUEST_GET_CARD_PRESENT, nullptr, 0) == 0) {
@@ -159,13 +213,17 @@ Return<bool> ZerbSimSecureElement::isCardPresent() {
 }
 
 Return<void> ZerbSimSecureElement::transmit(const hidl_vec<uint8_t>& data, transmit_cb _hidl_cb) {
-  SimLock lock;
-  selectModem("transmit");
+  SimLock lock("transmit");
   hidl_vec<uint8_t> response;
+  if (!lock.held()) {
+    _hidl_cb(response);
+    return Void();
+  }
+  selectModem("transmit");
   // Sizes beyond int32 are refused by the push as an invalid length.
   int32_t len = data.size() > static_cast<size_t>(INT32_MAX) ? -1 : static_cast<int32_t>(data.size());
   if (asyncCmdPush(m_modem_id, REQUEST_TRANSMIT_APDU, data.data(), len) == 0) {
-    SIM_LOGD("%s, now copy data, modem_id: %d", "transmit", m_modem_id);
+    SIM_LOGD("%s, now copy data, modem_id: %d", "transmit", m_modem_id.load());
     if (g_asyncCmd.param == 0 && g_asyncCmd.datalen >= 1 &&
         g_asyncCmd.datalen <= ASYNC_CMD_DATA_MAX) {
       response = bytesOf(g_asyncCmd.data, g_asyncCmd.datalen);
@@ -177,14 +235,18 @@ Return<void> ZerbSimSecureElement::transmit(const hidl_vec<uint8_t>& data, trans
 
 Return<void> ZerbSimSecureElement::openLogicalChannel(const hidl_vec<uint8_t>& aid, uint8_t p2,
                                                       openLogicalChannel_cb _hidl_cb) {
-  SimLock lock;
-  selectModem("openLogicalChannel");
+  SimLock lock("openLogicalChannel");
   LogicalChannelResponse response;
   SecureElementStatus status = SecureElementStatus::FAILED;
+  if (!lock.held()) {
+    _hidl_cb(response, status);
+    return Void();
+  }
+  selectModem("openLogicalChannel");
   g_asyncCmd.param = static_cast<int32_t>(p2);
   int32_t len = aid.size() > static_cast<size_t>(INT32_MAX) ? -1 : static_cast<int32_t>(aid.size());
   if (asyncCmdPush(m_modem_id, REQUEST_OPEN_LOGICAL_CHANNEL, aid.data(), len) == 0) {
-    SIM_LOGD("%s, now copy data, modem_id: %d", "openLogicalChannel", m_modem_id);
+    SIM_LOGD("%s, now copy data, modem_id: %d", "openLogicalChannel", m_modem_id.load());
     uint8_t code = static_cast<uint8_t>(g_asyncCmd.param & 0xFF);
     if (code != 0) {
       status = static_cast<SecureElementStatus>(code);
@@ -210,7 +272,9 @@ Return<void> ZerbSimSecureElement::openBasicChannel(const hidl_vec<uint8_t>&, ui
 }
 
 Return<SecureElementStatus> ZerbSimSecureElement::closeChannel(uint8_t channelNumber) {
-  SimLock lock;
+  // Given up, the channel stays flagged: it was not closed.
+  SimLock lock("closeChannel");
+  if (!lock.held()) return SecureElementStatus::FAILED;
   selectModem("closeChannel");
   SecureElementStatus status = SecureElementStatus::FAILED;
   g_asyncCmd.param = static_cast<int32_t>(channelNumber);
@@ -222,7 +286,7 @@ Return<SecureElementStatus> ZerbSimSecureElement::closeChannel(uint8_t channelNu
 }
 
 void ZerbSimSecureElement::serviceDied(uint64_t, const wp<IBase>&) {
-  SIM_LOGD("%s, enter, modem_id: %d", "serviceDied", m_modem_id);
+  SIM_LOGD("%s, enter, modem_id: %d", "serviceDied", m_modem_id.load());
 }
 
 }  // namespace implementation

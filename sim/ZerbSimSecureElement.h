@@ -58,12 +58,13 @@ struct ZerbSimSecureElement : public ISecureElement, public hidl_death_recipient
 
   void serviceDied(uint64_t cookie, const wp<IBase>& who) override;
 
-  int modemId() const { return m_modem_id; }
+  int modemId() const { return m_modem_id.load(); }
 
  private:
   void selectModem(const char* operation);
 
-  int32_t m_modem_id;
+  // Written under the front's lock, read without it by init and serviceDied.
+  std::atomic<int32_t> m_modem_id;
 };
 
 }  // namespace implementation

@@ -1,11 +1,13 @@
 #include "async_cmd.h"
 
+#include <errno.h>
 #include <fcntl.h>
 #include <securec.h>
 #include <unistd.h>
 
 #include <cstdlib>
 #include <cstring>
+#include <ctime>
 
 #include "qv_log.h"
 #include "se_delay.h"
@@ -47,11 +49,44 @@ class InitLock {
   InitLock& operator=(const InitLock&) = delete;
 };
 
+class ChannelLock {
+ public:
+  explicit ChannelLock(AsyncCmdChannel& ch) : m_(&ch.mutex) { pthread_mutex_lock(m_); }
+  ~ChannelLock() { pthread_mutex_unlock(m_); }
+  ChannelLock(const ChannelLock&) = delete;
+  ChannelLock& operator=(const ChannelLock&) = delete;
+
+ private:
+  pthread_mutex_t* m_;
+};
+
 const char* const kDevPath[ASYNC_CMD_MODEM_MAX] = {MODEM0_AT_DEV_PATH, MODEM1_AT_DEV_PATH};
 
 constexpr int kOpenTryCount = 5;
 constexpr uint64_t kOpenRetryMicros = 1000000;
 constexpr uint64_t kWorkerStartMicros = 20000;
+// How often an idle worker looks whether its port is still there.
+constexpr uint64_t kPortCheckMicros = 1000000;
+
+// Workers of each modem that have not yet left their record; guarded by the
+// modem's mutex, signalled on g_workerGone when one leaves.
+int32_t g_workers[ASYNC_CMD_MODEM_MAX];
+pthread_cond_t g_workerGone = PTHREAD_COND_INITIALIZER;
+
+// The workers' timed waits run on the monotonic clock, so that a change of
+// the wall clock neither stretches nor cuts a retry pause.
+bool monotonicRequestConds() {
+  pthread_condattr_t attr;
+  pthread_condattr_init(&attr);
+  pthread_condattr_setclock(&attr, CLOCK_MONOTONIC);
+  for (AsyncCmdChannel& ch : g_asyncCmdChannel) {
+    pthread_cond_destroy(&ch.req_cond);
+    pthread_cond_init(&ch.req_cond, &attr);
+  }
+  pthread_condattr_destroy(&attr);
+  return true;
+}
+[[maybe_unused]] const bool g_condsReady = monotonicRequestConds();
 
 void* cmdloopEntry(void* arg) {
   cmdloop(static_cast<AsyncCmdChannel*>(arg));
@@ -60,7 +95,7 @@ void* cmdloopEntry(void* arg) {
 
 bool validModem(int32_t modem_id) { return modem_id == 0 || modem_id == 1; }
 
-int openPort(const char* path) { return open(path, O_RDWR | O_NOCTTY); }
+int openPort(const char* path) { return asyncCmdOpenPort(path); }
 
 int hexNibble(char c) {
   if (c >= '0' && c <= '9') return c - '0';
@@ -69,12 +104,141 @@ int hexNibble(char c) {
   return -1;
 }
 
+bool requestFor(int32_t id) {
+  return g_asyncCmd.state == CMD_STATE_REQUEST && g_asyncCmd.modem_id == id;
+}
+
+// The monotonic time `micros` (scaled by the delay seam) from now.
+struct timespec deadlineIn(uint64_t micros) {
+  uint64_t us = se_delay::scaledMicros(micros);
+  struct timespec t;
+  clock_gettime(CLOCK_MONOTONIC, &t);
+  uint64_t nsec = static_cast<uint64_t>(t.tv_nsec) + (us % 1000000ULL) * 1000ULL;
+  t.tv_sec += static_cast<time_t>(us / 1000000ULL + nsec / 1000000000ULL);
+  t.tv_nsec = static_cast<long>(nsec % 1000000000ULL);
+  return t;
+}
+
+// Waits on the worker's condition (channel mutex held) until a wake-up or
+// `deadline`; true when the deadline has passed.
+bool waitOnChannel(AsyncCmdChannel* ch, const struct timespec& deadline) {
+  return pthread_cond_timedwait(&ch->req_cond, &ch->mutex, &deadline) == ETIMEDOUT;
+}
+
+bool running(AsyncCmdChannel* ch) {
+  ChannelLock lock(*ch);
+  return ch->running != 0;
+}
+
+// Pauses one open retry; only a stop cuts it short. False once stopped.
+bool pauseBeforeRetry(AsyncCmdChannel* ch) {
+  const struct timespec end = deadlineIn(kOpenRetryMicros);
+  ChannelLock lock(*ch);
+  while (ch->running != 0) {
+    if (waitOnChannel(ch, end)) return ch->running != 0;
+  }
+  return false;
+}
+
+// The start: the port is opened up to six times, one second apart.
+// Returns the descriptor, or -1 after the sixth failure or a stop.
+int openAtStart(AsyncCmdChannel* ch, int32_t id) {
+  int openTryCount = kOpenTryCount;
+  int fd = openPort(ch->dev_path);
+  QV_LOGI("%s[%d] open[%s] fd: %d, openTryCount: %d", "cmdloop", id, ch->dev_path, fd,
+          openTryCount);
+  // A descriptor 0 counts as failed too: the port never takes stdin's place.
+  while (fd < 1) {
+    if (fd >= 0) close(fd);
+    if (openTryCount == 0) {
+      QV_LOGE("%s[%d] Wait AT port timeout, fail", "cmdloop", id);
+      return -1;
+    }
+    openTryCount--;
+    if (!pauseBeforeRetry(ch)) return -1;
+    fd = openPort(ch->dev_path);
+    QV_LOGI("%s[%d] open[%s] fd: %d, openTryCount: %d", "cmdloop", id, ch->dev_path, fd,
+            openTryCount);
+  }
+  return fd;
+}
+
+// A port that is away (not there at the start, or lost since) is tried
+// once a second, and at once when a caller or an init asks for the modem,
+// until it opens or the worker is stopped (-1). Quiet while it fails.
+int waitForPort(AsyncCmdChannel* ch, int32_t id) {
+  for (;;) {
+    {
+      ChannelLock lock(*ch);
+      if (ch->running == 0) return -1;
+      (void)waitOnChannel(ch, deadlineIn(kOpenRetryMicros));
+      if (ch->running == 0) return -1;
+    }
+    int fd = openPort(ch->dev_path);
+    if (fd >= 1) {
+      QV_LOGI("%s[%d] open[%s] fd: %d, AT port back", "cmdloop", id, ch->dev_path, fd);
+      return fd;
+    }
+    if (fd >= 0) close(fd);
+  }
+}
+
+// Serves requests until the worker is stopped (false) or its port is lost
+// (true). A request posted before the loss is still run: its AT commands
+// fail at once on the closed port and the caller gets the usual failure.
+bool serve(AsyncCmdChannel* ch, int32_t id, bool watchPort) {
+  ChannelLock lock(*ch);
+  for (;;) {
+    while (ch->running != 0 && !requestFor(id)) {
+      if (watchPort && at_is_closed() != 0) {
+        // Under the mutex: no push can post for this modem from here on.
+        atPortOpened[id] = 0;
+        return true;
+      }
+      (void)waitOnChannel(ch, deadlineIn(kPortCheckMicros));
+    }
+    if (ch->running == 0) return false;
+    QV_LOGD("%s, deal command=%d,%d", "cmdloop", g_asyncCmd.request, id);
+    ch->handler();
+    g_asyncCmd.modem_id = id;
+    g_asyncCmd.state = CMD_STATE_RESPONSE;
+    pthread_cond_signal(&ch->resp_cond);
+  }
+}
+
+// The worker has left: a later init_at_channel may start another.
+void workerEnded(AsyncCmdChannel* ch, int32_t id) {
+  atPortOpened[id] = 0;
+  {
+    InitLock lock;
+    free(ch->dev_path);
+    ch->dev_path = nullptr;
+    ch->thread = pthread_t();
+    pthread_attr_destroy(&asyncCmdAttr[id]);
+    asyncCmdInited[id] = 0;
+  }
+  ChannelLock lock(*ch);
+  g_workers[id]--;
+  pthread_cond_broadcast(&g_workerGone);
+}
+
+// Wakes the worker of a started modem, so that a worker waiting for its
+// port tries it now.
+void pokeWorker(int32_t modem_id) {
+  AsyncCmdChannel& ch = g_asyncCmdChannel[modem_id];
+  ChannelLock lock(ch);
+  pthread_cond_broadcast(&ch.req_cond);
+}
+
 }  // namespace
 
 int32_t init_at_channel(int32_t modem_id) {
   if (!validModem(modem_id)) return -1;
   InitLock lock;
-  if (asyncCmdInited[modem_id] == 1) return 0;
+  if (asyncCmdInited[modem_id] == 1) {
+    if (atPortOpened[modem_id] != 1) pokeWorker(modem_id);
+    return 0;
+  }
   const char* path = kDevPath[modem_id];
   QV_LOGI("%s, devpath: %s", "asyncCmdInit", path);
 
@@ -82,8 +246,12 @@ int32_t init_at_channel(int32_t modem_id) {
   pthread_attr_setdetachstate(&asyncCmdAttr[modem_id], PTHREAD_CREATE_DETACHED);
 
   AsyncCmdChannel& ch = g_asyncCmdChannel[modem_id];
-  ch.modem_id = modem_id;
-  ch.running = 1;
+  {
+    ChannelLock chLock(ch);
+    ch.modem_id = modem_id;
+    ch.running = 1;
+    g_workers[modem_id]++;
+  }
   ch.unsol_handler = nullptr;
   ch.timeout_handler = nullptr;
   ch.handler = processRequest;
@@ -96,11 +264,29 @@ int32_t init_at_channel(int32_t modem_id) {
     pthread_attr_destroy(&asyncCmdAttr[modem_id]);
     free(ch.dev_path);
     ch.dev_path = nullptr;
+    ChannelLock chLock(ch);
+    ch.running = 0;
+    g_workers[modem_id]--;
     return -1;
   }
   se_delay::sleepMicros(kWorkerStartMicros);
   asyncCmdInited[modem_id] = 1;
   return 0;
+}
+
+void asyncCmdStop(int32_t modem_id) {
+  if (!validModem(modem_id)) return;
+  AsyncCmdChannel& ch = g_asyncCmdChannel[modem_id];
+  ChannelLock lock(ch);
+  ch.running = 0;
+  pthread_cond_broadcast(&ch.req_cond);
+  while (g_workers[modem_id] > 0) pthread_cond_wait(&g_workerGone, &ch.mutex);
+}
+
+int64_t asyncCmdSilenceMicros(void) {
+  int64_t a = at_silence_micros(0);
+  int64_t b = at_silence_micros(1);
+  return a > b ? a : b;
 }
 
 void cmdloop(AsyncCmdChannel* channel) {
@@ -113,54 +299,45 @@ void cmdloop(AsyncCmdChannel* channel) {
   atPortOpened[id] = 0;
   QV_LOGI("%s[%d] > Start...", "cmdloop", id);
 
+  const bool havePath = channel->dev_path != nullptr && channel->dev_path[0] != '\0';
   int fd = -1;
-  if (channel->dev_path != nullptr && channel->dev_path[0] != '\0') {
-    int openTryCount = kOpenTryCount;
-    fd = openPort(channel->dev_path);
-    QV_LOGI("%s[%d] open[%s] fd: %d, openTryCount: %d", "cmdloop", id, channel->dev_path, fd,
-            openTryCount);
-    // A descriptor 0 counts as failed too: the port never takes stdin's place.
-    while (fd < 1) {
-      if (openTryCount == 0) {
-        QV_LOGE("%s[%d] Wait AT port timeout, fail", "cmdloop", id);
-        if (fd >= 0) close(fd);
-        return;
-      }
-      openTryCount--;
-      se_delay::sleepMicros(kOpenRetryMicros);
-      fd = openPort(channel->dev_path);
-      QV_LOGI("%s[%d] open[%s] fd: %d, openTryCount: %d", "cmdloop", id, channel->dev_path, fd,
-              openTryCount);
+  if (havePath) {
+    fd = openAtStart(channel, id);
+    if (fd < 1 && running(channel)) {
+      // A modem that comes up late is still served once its port appears.
+      QV_LOGE("%s[%d] still waiting for the AT port", "cmdloop", id);
+      fd = waitForPort(channel, id);
+    }
+    if (fd < 1) {
+      workerEnded(channel, id);
+      return;
     }
   }
 
-  if (at_open(fd, channel->unsol_handler, id) != 0) {
-    QV_LOGE("%s, at_open fail", "cmdloop");
-    return;
-  }
-  atPortOpened[id] = 1;
-  at_set_on_timeout(channel->timeout_handler);
-
-  while (channel->running != 0) {
-    pthread_mutex_lock(&channel->mutex);
-    while (!(g_asyncCmd.state == CMD_STATE_REQUEST && g_asyncCmd.modem_id == id)) {
-      pthread_cond_wait(&channel->req_cond, &channel->mutex);
+  for (;;) {
+    if (at_open(fd, channel->unsol_handler, id) != 0) {
+      QV_LOGE("%s, at_open fail", "cmdloop");
+      break;
     }
-    QV_LOGD("%s, deal command=%d,%d", "cmdloop", g_asyncCmd.request, id);
-    channel->handler();
-    g_asyncCmd.modem_id = id;
-    g_asyncCmd.state = CMD_STATE_RESPONSE;
-    pthread_cond_signal(&channel->resp_cond);
-    pthread_mutex_unlock(&channel->mutex);
+    {
+      ChannelLock lock(*channel);
+      atPortOpened[id] = 1;
+    }
+    at_set_on_timeout(channel->timeout_handler);
+    if (!serve(channel, id, havePath)) break;
+
+    QV_LOGE("%s[%d] AT port lost, channels closed; reopening", "cmdloop", id);
+    at_close();
+    // The channels of a lost port are gone with it: the modem forgets its
+    // sessions when its port goes away.
+    clear_session_table(id);
+    fd = waitForPort(channel, id);
+    if (fd < 1) break;
   }
 
   QV_LOGI("%s[%d] < Stop", "cmdloop", id);
   at_close();
-  free(channel->dev_path);
-  channel->dev_path = nullptr;
-  channel->thread = pthread_t();
-  pthread_attr_destroy(&asyncCmdAttr[id]);
-  atPortOpened[id] = 0;
+  workerEnded(channel, id);
 }
 
 void processRequest(void) {
@@ -182,6 +359,7 @@ int32_t asyncCmdPush(int32_t modem_id, int32_t request, const uint8_t* data, int
   }
   if (atPortOpened[modem_id] != 1) {
     QV_LOGE("%s, atPortOpened[%d] not open", "asyncCmdPush", modem_id);
+    if (asyncCmdInited[modem_id] == 1) pokeWorker(modem_id);
     return -1;
   }
   if (request < 1 || request > 6) {
@@ -199,6 +377,12 @@ int32_t asyncCmdPush(int32_t modem_id, int32_t request, const uint8_t* data, int
 
   AsyncCmdChannel& ch = g_asyncCmdChannel[modem_id];
   pthread_mutex_lock(&ch.mutex);
+  if (atPortOpened[modem_id] != 1) {
+    // Lost since the check above: the worker no longer takes requests.
+    pthread_mutex_unlock(&ch.mutex);
+    QV_LOGE("%s, atPortOpened[%d] not open", "asyncCmdPush", modem_id);
+    return -1;
+  }
   g_asyncCmd.modem_id = modem_id;
   g_asyncCmd.request = request;
   g_asyncCmd.datalen = datalen;

@@ -77,6 +77,17 @@ extern const RequestTableEntry requestTable[5];
 int32_t init_at_channel(int32_t modem_id);
 // The worker: opens the port, then serves requests for its modem.
 void cmdloop(AsyncCmdChannel* channel);
+// Stops the modem's worker, if one runs, and waits until it has left: the
+// port is closed and a later init_at_channel starts a new worker. A request
+// in progress is finished first.
+void asyncCmdStop(int32_t modem_id);
+// Opens a modem's AT port by path for reading and writing (not as the
+// controlling terminal); a descriptor or -1. Its own unit, so that tests can
+// watch the worker's open attempts.
+int asyncCmdOpenPort(const char* path);
+// How long the command in flight on either modem has waited without a line
+// of its answer, in microseconds; 0 when none waits.
+int64_t asyncCmdSilenceMicros(void);
 // Runs the handler of g_asyncCmd.request on the worker thread.
 void processRequest(void);
 // Posts one request to the modem's worker and waits for it to finish.
@@ -104,3 +115,5 @@ extern int32_t sessionTable[ASYNC_CMD_MODEM_MAX][SESSION_TABLE_SIZE];
 extern int32_t* curSessionTable;
 // Points curSessionTable at the table of the calling worker's modem.
 void adjust_session(void);
+// Forgets every session recorded for the modem.
+void clear_session_table(int32_t modem_id);

@@ -67,11 +67,21 @@ bool readHexAnswer(const char* fn, char* line, const char** hex, int32_t* n) {
     QV_LOGE("%s: %s\n", fn, "at_tok_nextstr(&p_line, &(response_str)) error");
     return false;
   }
+  const size_t textLen = strlen(responseStr);
+  if (responseLength >= 0 && textLen > static_cast<size_t>(responseLength)) {
+    // Cutting the text to the length would drop the status word.
+    QV_LOGE("%s, length %d shorter than the %zu hex digits given", fn, responseLength, textLen);
+    return false;
+  }
+  if (textLen == 2) {
+    // One byte cannot hold the status word every response ends with.
+    QV_LOGE("%s, one-byte answer has no status word", fn);
+    return false;
+  }
   *hex = responseStr;
-  // A negative length stays negative so that the decoding reports it.
-  *n = responseLength < 0
-           ? responseLength
-           : static_cast<int32_t>(strnlen(responseStr, static_cast<size_t>(responseLength)));
+  // A negative length stays negative so that the decoding reports it; a
+  // longer one is lowered to the text's length.
+  *n = responseLength < 0 ? responseLength : static_cast<int32_t>(textLen);
   return true;
 }
 
@@ -92,9 +102,12 @@ bool closeModemSession(const char* fn, int32_t session) {
   return closed;
 }
 
-// The SELECT by AID on the new session. Returns the status of the open.
+// The SELECT by AID on the new session. Returns the status of the open;
+// *portAnswers is false when the exchange timed out or found the port
+// closed, where a release command would only wait in vain as well.
 int32_t transmit_select_cmd(int32_t channel, int32_t aidLen, int32_t selectP2,
-                            const char* openCmd) {
+                            const char* openCmd, bool* portAnswers) {
+  *portAnswers = true;
   static const char* const kFn = "transmit_select_cmd";
   char aidHex[2 * kAidMaxLen + 1];
   (void)memset_s(aidHex, sizeof(aidHex), 0, sizeof(aidHex));
@@ -113,6 +126,7 @@ int32_t transmit_select_cmd(int32_t channel, int32_t aidLen, int32_t selectP2,
   int32_t err = at_send_command_singleline(cmd, "+CGLA:", response.out());
   if (!exchangeOk(err, response.get())) {
     logExchangeFailure(kFn, err, response.get());
+    *portAnswers = err != AT_ERROR_CHANNEL_CLOSED && err != AT_ERROR_TIMEOUT;
     return 1;
   }
   const char* hex = nullptr;
@@ -149,6 +163,11 @@ void adjust_session(void) {
   } else {
     QV_LOGE("%s, modem_id: %d is invalid", "adjust_session", m);
   }
+}
+
+void clear_session_table(int32_t modem_id) {
+  if (modem_id < 0 || modem_id >= ASYNC_CMD_MODEM_MAX) return;
+  for (int32_t& session : sessionTable[modem_id]) session = 0;
 }
 
 void request_get_card_present(void) {
@@ -262,8 +281,10 @@ void request_open_logical_channel(void) {
     return;
   }
 
+  // The session id may come bare on its line (3GPP TS 27.007's plain form)
+  // as well as after the prefix.
   ResponseHolder openResponse;
-  int32_t err = at_send_command_singleline(openCmd, responsePrefix, openResponse.out());
+  int32_t err = at_send_command_singleline_or_numeric(openCmd, responsePrefix, openResponse.out());
   if (err < 0 || openResponse.get() == nullptr || openResponse.get()->success == 0) {
     int32_t cmeErr = at_get_cme_error(openResponse.get());
     QV_LOGE("%s, cme_err: %d", kFn, cmeErr);
@@ -278,7 +299,8 @@ void request_open_logical_channel(void) {
   }
   char* line = openResponse.get()->p_intermediates->text;
   int32_t sessionId = 0;
-  if (at_tok_start(&line) < 0) {
+  const bool bare = strncmp(line, responsePrefix, strlen(responsePrefix)) != 0;
+  if (!bare && at_tok_start(&line) < 0) {
     QV_LOGE("%s: %s\n", kFn, "at_tok_start(&p_line) error");
     g_asyncCmd.param = 1;
     return;
@@ -292,15 +314,17 @@ void request_open_logical_channel(void) {
   int32_t channel = sessionId & 0x1F;
   if (channel == 0 || channel >= SESSION_TABLE_SIZE) {
     QV_LOGE("%s, modem channel %d is invalid", kFn, channel);
-    (void)closeModemSession(kFn, sessionId);
+    // An id below 1 names no channel the modem could close.
+    if (sessionId >= 1) (void)closeModemSession(kFn, sessionId);
     g_asyncCmd.param = 1;
     return;
   }
   adjust_session();
   curSessionTable[channel] = sessionId;
 
-  int32_t status = transmit_select_cmd(channel, aidLen, selectP2, openCmd);
-  if (status != 0 && closeModemSession(kFn, sessionId)) {
+  bool portAnswers = true;
+  int32_t status = transmit_select_cmd(channel, aidLen, selectP2, openCmd, &portAnswers);
+  if (status != 0 && portAnswers && closeModemSession(kFn, sessionId)) {
     curSessionTable[channel] = 0;
   }
   g_asyncCmd.param = status;

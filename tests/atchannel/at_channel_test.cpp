@@ -5,7 +5,10 @@
 #include <host/log_capture.h>
 #include <signal.h>
 
+#include <sys/socket.h>
+
 #include <atomic>
+#include <future>
 
 #include "atchannel.h"
 #include "scripted_modem.h"
@@ -77,18 +80,34 @@ std::vector<std::string> intermediates(const ATResponse* r) {
   return out;
 }
 
+// The process-wide state these tests touch, as at start. The channel's
+// own records live per thread; each test closes what it opened.
+void resetChannelTests() {
+  signal(SIGPIPE, SIG_IGN);
+  se_delay::setDivisorForTest(1);
+  g_unsol.reset();
+  g_ulModemId = 0;
+}
+
+// Tests that open their own port, or none.
+class ChannelWrite : public ::testing::Test {
+ protected:
+  void SetUp() override { resetChannelTests(); }
+  void TearDown() override {
+    at_set_on_timeout(nullptr);
+    at_close();
+    resetChannelTests();
+  }
+};
+using NoContext = ChannelWrite;
+
 class Channel : public ::testing::Test {
  protected:
-  void SetUp() override {
-    signal(SIGPIPE, SIG_IGN);
-    se_delay::setDivisorForTest(1);
-    g_unsol.reset();
-    g_ulModemId = 0;
-  }
+  void SetUp() override { resetChannelTests(); }
   void TearDown() override {
     at_close();
     modem_.reset();
-    se_delay::setDivisorForTest(1);
+    resetChannelTests();
   }
   // Opens the channel on this thread over a socket pair answered by `script`.
   void open(ScriptedModem::Script script, std::unique_ptr<ScriptedModem> modem = ScriptedModem::socketPair()) {
@@ -208,6 +227,87 @@ TEST_F(Channel, ErrorFinalResponses) {
     EXPECT_EQ(r->p_intermediates, nullptr);
     EXPECT_EQ(at_get_cme_error(r.get()), c.cme);
   }
+}
+
+// Once a command has its final line, a second one is not its answer: it
+// goes to the unsolicited handler and the first stays. Repeated, since the
+// sender may wake before the reader reaches the second line.
+TEST_F(Channel, SecondFinalLineDoesNotReplaceTheFirst) {
+  open(answer("+CME ERROR: 5\r\nOK\r\n"));
+  for (int i = 0; i < 20; i++) {
+    ATResponse* raw = nullptr;
+    ASSERT_EQ(at_send_command("AT+X", &raw), AT_OK);
+    ResponsePtr r(raw);
+    EXPECT_EQ(r->success, 0);
+    EXPECT_STREQ(r->final_response, "+CME ERROR: 5");
+    ASSERT_TRUE(eventually([&] { return g_unsol.snapshot().size() == static_cast<size_t>(i + 1); }));
+    EXPECT_EQ(g_unsol.snapshot().back().first, "OK");
+  }
+}
+
+// The plain form of 3GPP TS 27.007 (the number alone on its line) is the
+// answer only where the command allows it.
+TEST_F(Channel, BareNumberAnswersOnlyWhereAllowed) {
+  SwitchableReply reply;
+  open(reply.script("\r\nOK\r\n"));
+  struct Case {
+    const char* reply;
+    bool numericAllowed;
+    int32_t rc;
+    const char* intermediate;  // nullptr: none
+  };
+  const Case cases[] = {
+      {"257", true, AT_OK, "257"},
+      {"+CCHO: 257", true, AT_OK, "+CCHO: 257"},
+      {"257", false, AT_ERROR_INVALID_RESPONSE, nullptr},
+      {"25 7", true, AT_ERROR_INVALID_RESPONSE, nullptr},
+      {"-1", true, AT_ERROR_INVALID_RESPONSE, nullptr},
+  };
+  for (const Case& c : cases) {
+    SCOPED_TRACE(std::string(c.reply) + (c.numericAllowed ? " numeric" : " prefixed"));
+    reply.set(c.reply);
+    ATResponse* raw = nullptr;
+    int32_t rc = c.numericAllowed ? at_send_command_singleline_or_numeric("AT+CCHO=\"A0\"", "+CCHO:", &raw)
+                                  : at_send_command_singleline("AT+CCHO=\"A0\"", "+CCHO:", &raw);
+    ResponsePtr r(raw);
+    EXPECT_EQ(rc, c.rc);
+    if (c.intermediate != nullptr) {
+      ASSERT_TRUE(r);
+      EXPECT_EQ(intermediates(r.get()), std::vector<std::string>{c.intermediate});
+    }
+  }
+}
+
+// How long the pending command has gone without an answer line: what the
+// SIM front asks to tell a working modem from a silent one.
+TEST_F(Channel, SilenceOfThePendingCommand) {
+  open([](ScriptedModem& m, const std::string&) {
+    // Answers only once the channel counts the command as silent.
+    ASSERT_TRUE(eventually([] { return at_silence_micros(0) >= 2000; }));
+    m.send("OK\r\n");
+  });
+  EXPECT_EQ(at_silence_micros(0), 0);
+  EXPECT_EQ(at_send_command("AT+X", nullptr), AT_OK);
+  EXPECT_EQ(at_silence_micros(0), 0);
+  EXPECT_EQ(at_silence_micros(1), 0);
+  EXPECT_EQ(at_silence_micros(2), 0);
+}
+
+// A modem that stops reading cannot hold the sender past the command's
+// deadline: the write gives up with a time-out and a log line.
+TEST_F(ChannelWrite, WriteToAModemThatNeverReadsEndsAtTheDeadline) {
+  android::host::LogCapture cap;
+  se_delay::setDivisorForTest(1000);  // 600 s become 600 ms
+  int sv[2];
+  ASSERT_EQ(socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, sv), 0);
+  ASSERT_EQ(at_open(sv[0], onUnsol, 0), 0);  // nobody reads sv[1]
+  const std::string huge = "AT+" + std::string(4 << 20, 'A');
+  EXPECT_EQ(at_send_command(huge.c_str(), nullptr), AT_ERROR_TIMEOUT);
+  EXPECT_EQ(countLogs(cap, "m0_" + std::to_string(sv[0]) + ">write timed out"), 1u);
+  // The channel still works for a modem that reads again.
+  at_close();
+  close(sv[1]);
+  se_delay::setDivisorForTest(1);
 }
 
 TEST_F(Channel, SilentModemTimesOutAndTheLateAnswerIsUnsolicited) {
@@ -416,7 +516,7 @@ TEST_F(Channel, OpenWithoutAPortEndsTheReaderAndCommandsFail) {
   EXPECT_EQ(at_open(-1, onUnsol, 2), -1);  // only two modem slots
 }
 
-TEST(ChannelWrite, FailingWritesGiveUpAfterFiveAttempts) {
+TEST_F(ChannelWrite, FailingWritesGiveUpAfterFiveAttempts) {
   android::host::LogCapture cap;
   se_delay::setDivisorForTest(1000);
   int p[2];
@@ -435,12 +535,13 @@ TEST(ChannelWrite, FailingWritesGiveUpAfterFiveAttempts) {
   EXPECT_EQ(countLogs(cap, "m0_" + std::to_string(p[0]) + ">AT\n"), 5u);
   EXPECT_EQ(g_timeouts.load(), 1);
   EXPECT_EQ(countLogs(cap, "m0_0< timeout."), 1u);
+  at_set_on_timeout(nullptr);  // the thread's context outlives the test
   at_close();
   close(p[1]);
   se_delay::setDivisorForTest(1);
 }
 
-TEST(NoContext, OperationsOnAThreadWithoutAPortFail) {
+TEST_F(NoContext, OperationsOnAThreadWithoutAPortFail) {
   android::host::LogCapture cap;
   int32_t send = 0, single = 0, index = 0;
   ATResponse* r = reinterpret_cast<ATResponse*>(0x1);

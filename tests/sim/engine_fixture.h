@@ -10,7 +10,9 @@
 
 #include "async_cmd.h"
 #include "fake_modem.h"
+#include "port_open_seam.h"
 #include "se_delay.h"
+#include "sim_test_reset.h"
 #include "test_root.h"
 
 namespace sim_test {
@@ -40,9 +42,15 @@ inline std::string hexOf(const std::vector<uint8_t>& bytes) {
 class EngineTest : public ::testing::Test {
  protected:
   void SetUp() override {
+    resetEngine();
     se_delay::setDivisorForTest(100);
     modem0_ = modemAt(root_.at("dev/appvcom18"));
     ASSERT_TRUE(modem0_);
+  }
+  // Workers first: they hold the ports the modems serve.
+  void TearDown() override {
+    resetEngine();
+    setBeforeOpen(nullptr);
   }
   void startModem1() {
     modem1_ = modemAt(root_.at("dev/appvcom34"));

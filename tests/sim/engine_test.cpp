@@ -10,11 +10,16 @@
 #include <fstream>
 #include <sstream>
 
+#include <atomic>
+#include <future>
+#include <thread>
+
 #include "engine_fixture.h"
 
 namespace {
 
 using android::host::LogCapture;
+using sim_test::FakeModem;
 using sim_test::finalLine;
 using sim_test::hexOf;
 using sim_test::okLine;
@@ -25,6 +30,8 @@ using sim_test::waitUntil;
 constexpr const char* kTag = "QvAtChannel";
 
 class Engine : public sim_test::EngineTest {};
+
+Replies openReplies(int session, const std::string& select);
 
 TEST_F(Engine, PushRefusalsAndAcceptedEdges) {
   LogCapture cap;
@@ -89,7 +96,19 @@ TEST_F(Engine, InitAtChannelStartsOneWorkerPerModem) {
   EXPECT_EQ(-1, init_at_channel(-1));
   EXPECT_TRUE(cap.records().empty());
   EXPECT_EQ(0, asyncCmdInited[0]);
-  startWorker(0);
+  // Two inits at once (the front's init runs without its lock): the 20 ms
+  // start pause at full length leaves room for a second start.
+  se_delay::setDivisorForTest(1);
+  std::vector<std::thread> inits;
+  std::atomic<int> failed{0};
+  for (int i = 0; i < 2; i++) {
+    inits.emplace_back([&] {
+      if (init_at_channel(0) != 0) failed++;
+    });
+  }
+  for (std::thread& t : inits) t.join();
+  EXPECT_EQ(0, failed.load());
+  ASSERT_TRUE(waitUntil([] { return atPortOpened[0] == 1; }));
   EXPECT_EQ(0, init_at_channel(0));
   EXPECT_EQ(1u, cap.find("asyncCmdInit, devpath: /dev/appvcom18", kTag).size());
   EXPECT_EQ(1u, cap.find("cmdloop[0] > Start...", kTag).size());
@@ -97,15 +116,15 @@ TEST_F(Engine, InitAtChannelStartsOneWorkerPerModem) {
 }
 
 TEST_F(Engine, PortOpensAtThirdAttempt) {
-  se_delay::setDivisorForTest(5);  // 200 ms between attempts
   auto late = sim_test::modemAt(root_.at("dev/appvcom34"), /*linkNow=*/false);
   ASSERT_TRUE(late);
   late->setScript(scriptOf({{"AT^CARDTYPE?", okLine("^CARDTYPE: 1,1,0")}}));
+  // The port appears on the worker's thread right before its third try.
+  sim_test::setBeforeOpen([&](const std::string& path, int attempt) {
+    if (attempt == 3 && path.find("appvcom34") != std::string::npos) late->link();
+  });
   LogCapture cap;
   ASSERT_EQ(0, init_at_channel(1));
-  EXPECT_EQ(-1, push(1, REQUEST_GET_CARD_PRESENT, {}));  // port not open yet
-  ASSERT_TRUE(waitUntil([&] { return cap.contains("openTryCount: 4", kTag); }));
-  late->link();
   ASSERT_TRUE(waitUntil([] { return atPortOpened[1] == 1; }));
 
   std::vector<android::host::LogRecord> opens = cap.find("cmdloop[1] open[/dev/appvcom34] fd: ", kTag);
@@ -121,16 +140,70 @@ TEST_F(Engine, PortOpensAtThirdAttempt) {
   EXPECT_TRUE(late->received("AT^CARDTYPE?"));
 }
 
-TEST_F(Engine, PortThatNeverOpensEndsTheWorker) {
+// A modem whose port comes up only after the six start attempts (a boot
+// race) is served once the port is there; until then calls are refused.
+TEST_F(Engine, PortThatComesLateIsOpenedOnceThere) {
   se_delay::setDivisorForTest(1000);
+  auto late = sim_test::modemAt(root_.at("dev/appvcom34"), /*linkNow=*/false);
+  ASSERT_TRUE(late);
+  late->setScript(scriptOf({{"AT^CARDTYPE?", okLine("^CARDTYPE: 1,1,0")}}));
   LogCapture cap;
-  ASSERT_EQ(0, init_at_channel(1));  // no device for modem 1
-  ASSERT_TRUE(waitUntil([&] { return cap.contains("cmdloop[1] Wait AT port timeout, fail", kTag); }));
+  ASSERT_EQ(0, init_at_channel(1));
+  ASSERT_TRUE(waitUntil([&] { return cap.contains("cmdloop[1] still waiting for the AT port", kTag); }));
+  EXPECT_TRUE(cap.contains("cmdloop[1] Wait AT port timeout, fail", kTag));
   EXPECT_EQ(6u, cap.find("cmdloop[1] open[/dev/appvcom34] fd: -1", kTag).size());
-  EXPECT_TRUE(cap.contains("openTryCount: 0", kTag));
-  EXPECT_EQ(1, asyncCmdInited[1]);
-  EXPECT_EQ(0, init_at_channel(1));  // no second worker
   EXPECT_EQ(-1, push(1, REQUEST_GET_CARD_PRESENT, {}));
+  EXPECT_EQ(0, init_at_channel(1));  // the same worker keeps trying
+  late->link();
+  ASSERT_TRUE(waitUntil([] { return atPortOpened[1] == 1; }));
+  EXPECT_TRUE(cap.contains("cmdloop[1] open[/dev/appvcom34] fd: ", kTag));
+  EXPECT_TRUE(cap.contains(", AT port back", kTag));
+  EXPECT_EQ(1u, cap.find("cmdloop[1] > Start...", kTag).size());
+  EXPECT_EQ(0, push(1, REQUEST_GET_CARD_PRESENT, {}));
+  EXPECT_EQ(1, g_asyncCmd.param);
+}
+
+// A lost port (the modem restarts): requests fail while it is away, the
+// channels opened before are gone, and the worker serves the port again.
+TEST_F(Engine, LostPortIsReopenedAndItsChannelsAreGone) {
+  se_delay::setDivisorForTest(1000);
+  startWorker(0);
+  modem0_->setScript(scriptOf(openReplies(258, okLine("+CGLA: 4,9000"))));
+  ASSERT_EQ(0, push(0, REQUEST_OPEN_LOGICAL_CHANNEL, {0xA0, 0x00}, 0));
+  ASSERT_EQ(0, g_asyncCmd.param);
+
+  // The port goes away while a SELECT waits for its answer: the open fails
+  // without a release command, which could not be sent anyway.
+  std::promise<void> selectSent;
+  modem0_->setScript([&](FakeModem& m, const std::string& cmd) {
+    if (cmd.rfind("AT+CCHP=", 0) == 0) m.send(okLine("+CCHP: 259"));
+    if (cmd.rfind("AT+CGLA=", 0) == 0) selectSent.set_value();
+  });
+  LogCapture cap;
+  auto open = std::async(std::launch::async, [&] {
+    return push(0, REQUEST_OPEN_LOGICAL_CHANNEL, {0xA0, 0x01}, 0) == 0 ? g_asyncCmd.param : -100;
+  });
+  selectSent.get_future().wait();
+  modem0_.reset();
+  EXPECT_EQ(1, open.get());
+  EXPECT_TRUE(cap.contains("transmit_select_cmd:cmd return errno=-3", kTag));
+  EXPECT_FALSE(cap.contains("AT+CCHC"));
+  EXPECT_FALSE(cap.contains("release of modem session"));
+  ASSERT_TRUE(waitUntil([&] { return cap.contains("cmdloop[0] AT port lost", kTag); }));
+  EXPECT_EQ(ANDROID_LOG_ERROR, cap.find("cmdloop[0] AT port lost", kTag)[0].priority);
+  EXPECT_EQ(-1, push(0, REQUEST_GET_CARD_PRESENT, {}));
+
+  modem0_ = sim_test::modemAt(root_.at("dev/appvcom18"));
+  ASSERT_TRUE(modem0_);
+  modem0_->setScript(scriptOf({{"AT^CARDTYPE?", okLine("^CARDTYPE: 1,1,0")}}));
+  ASSERT_TRUE(waitUntil([] { return atPortOpened[0] == 1; }));
+  EXPECT_TRUE(cap.contains("cmdloop[0] open[/dev/appvcom18] fd: ", kTag));
+  EXPECT_EQ(0, push(0, REQUEST_GET_CARD_PRESENT, {}));
+  EXPECT_EQ(1, g_asyncCmd.param);
+  cap.clear();
+  ASSERT_EQ(0, push(0, REQUEST_TRANSMIT_APDU, {0x02, 0xB0, 0x00, 0x00}));
+  EXPECT_EQ(1, g_asyncCmd.param);
+  EXPECT_TRUE(cap.contains("request_transmit_apdu, channel 2 is not open", kTag));
 }
 
 TEST_F(Engine, CardPresence) {
@@ -297,7 +370,8 @@ int32_t closeOn(int32_t modem, int32_t channel) {
 
 TEST_F(Engine, UnusableSessionIdIsReleasedAtTheModem) {
   startWorker(0);
-  for (int session : {20, 32, 0x11F}) {
+  // Ids below 1 name no channel: nothing to release.
+  for (int session : {20, 32, 0x11F, 0, -32}) {
     SCOPED_TRACE(session);
     modem0_->setScript(scriptOf(openReplies(session, okLine("+CGLA: 4,9000"))));
     modem0_->clearCommands();
@@ -307,10 +381,40 @@ TEST_F(Engine, UnusableSessionIdIsReleasedAtTheModem) {
     EXPECT_TRUE(cap.contains("request_open_logical_channel, modem channel " +
                                  std::to_string(session & 0x1F) + " is invalid",
                              kTag));
-    EXPECT_EQ((std::vector<std::string>{"AT+CCHP=\"A000\",0",
-                                        "AT+CCHC=" + std::to_string(session)}),
-              modem0_->commands());
+    std::vector<std::string> sent = {"AT+CCHP=\"A000\",0"};
+    if (session >= 1) sent.push_back("AT+CCHC=" + std::to_string(session));
+    EXPECT_EQ(sent, modem0_->commands());
   }
+}
+
+// 3GPP TS 27.007 lets the modem answer the open with the session id alone.
+TEST_F(Engine, OpenTakesTheBareSessionId) {
+  startWorker(0);
+  for (int32_t p2 : {0x7F, 0x04}) {
+    SCOPED_TRACE(p2);
+    modem0_->setScript(scriptOf({{"AT+CCH", okLine("258")}, {"AT+CGLA=258,", okLine("+CGLA: 4,9000")}}));
+    ASSERT_EQ(0, push(0, REQUEST_OPEN_LOGICAL_CHANNEL, {0xA0, 0x00}, p2));
+    EXPECT_EQ(0, g_asyncCmd.param);
+    EXPECT_EQ(2, g_asyncCmd.data[0]);
+    EXPECT_EQ((std::vector<uint8_t>{0x90, 0x00}), result(1));
+  }
+  // A bare line that is not a number is not the answer.
+  modem0_->setScript(scriptOf({{"AT+CCHP=", okLine("25A")}}));
+  ASSERT_EQ(0, push(0, REQUEST_OPEN_LOGICAL_CHANNEL, {0xA0, 0x00}, 0));
+  EXPECT_EQ(1, g_asyncCmd.param);
+}
+
+// A SELECT that timed out leaves no release command behind it: the modem
+// did not answer one command and would hold the lock a third time-out.
+TEST_F(Engine, TimedOutSelectSendsNoRelease) {
+  se_delay::setDivisorForTest(10000);  // 600 s become 60 ms
+  startWorker(0);
+  modem0_->setScript(scriptOf({{"AT+CCHP=", okLine("+CCHP: 257")}, {"AT+CGLA=", ""}}));
+  LogCapture cap;
+  ASSERT_EQ(0, push(0, REQUEST_OPEN_LOGICAL_CHANNEL, {0xA0, 0x00}, 0));
+  EXPECT_EQ(1, g_asyncCmd.param);
+  EXPECT_TRUE(cap.contains("transmit_select_cmd:cmd return errno=-4", kTag));
+  EXPECT_EQ(2u, modem0_->commands().size());
 }
 
 TEST_F(Engine, FailedSelectClosesTheModemChannel) {
@@ -329,6 +433,10 @@ TEST_F(Engine, FailedSelectClosesTheModemChannel) {
        "transmit_select_cmd: at_tok_nextstr(&p_line, &(response_str)) error\n"},
       {"263 bytes after the channel byte", okLine("+CGLA: 526," + resp262 + "11"),
        "transmit_select_cmd, select response of 526 hex digits"},
+      // Without a status word: a length short of the text, or one byte.
+      {"length short of the text", okLine("+CGLA: 2,\"9000\""),
+       "transmit_select_cmd, length 2 shorter than the 4 hex digits given"},
+      {"one byte", okLine("+CGLA: 2,\"90\""), "transmit_select_cmd, one-byte answer has no status word"},
   };
   for (const Case& c : cases) {
     SCOPED_TRACE(c.name);
@@ -375,7 +483,6 @@ TEST_F(Engine, SelectResponseDecoding) {
       // The text decoding is shared with transmit; these are the forms
       // its table does not hold.
       {"+CGLA: 4,6f00", 2, {0x6F, 0x00}},
-      {"+CGLA: 2,\"9000\"", 1, {0x90}},
       {"+CGLA: -4,\"9000\"", -1, {}},
   };
   for (const Case& c : cases) {
@@ -497,7 +604,11 @@ TEST_F(Engine, TransmitAnswers) {
   const Case cases[] = {
       {okLine("+CSIM: 8,\"01029000\""), 0, 4, {0x01, 0x02, 0x90, 0x00}, nullptr},
       {okLine("+CSIM: 80,\"9000\""), 0, 2, {0x90, 0x00}, nullptr},
-      {okLine("+CSIM: 3,\"9000\""), 0, -1, {}, nullptr},
+      {okLine("+CSIM: 5,\"90000\""), 0, -1, {}, nullptr},
+      // A length shorter than the text, or a single byte: no status word.
+      {okLine("+CSIM: 2,\"9000\""), 1, 5, apdu, "request_transmit_apdu, length 2 shorter than the 4 hex digits"},
+      {okLine("+CSIM: 3,\"9000\""), 1, 5, apdu, "request_transmit_apdu, length 3 shorter"},
+      {okLine("+CSIM: 2,\"90\""), 1, 5, apdu, "request_transmit_apdu, one-byte answer has no status word"},
       {okLine("+CSIM: 4,\"90ZZ\""), 0, -1, {}, nullptr},
       {okLine("+CSIM: 0,\"\""), 0, 0, {}, nullptr},
       {okLine("+CSIM: 526," + hex263), 0, 263, std::vector<uint8_t>(263, 0x99), nullptr},

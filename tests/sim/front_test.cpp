@@ -2,11 +2,15 @@
 // results, channel flags, the init sweep and the modem chosen per call.
 #include <gtest/gtest.h>
 #include <host/log_capture.h>
+#include <log/log.h>
 
-#include <fstream>
+#include <atomic>
+#include <future>
+#include <thread>
 
 #include "ZerbSimSecureElement.h"
 #include "engine_fixture.h"
+#include "fake_uptime.h"
 
 namespace {
 
@@ -19,6 +23,7 @@ using android::hardware::secure_element::V1_0::LogicalChannelResponse;
 using android::hardware::secure_element::V1_0::SecureElementStatus;
 using android::hardware::secure_element::V1_0::implementation::ZerbSimSecureElement;
 using android::host::LogCapture;
+using sim_test::FakeModem;
 using sim_test::finalLine;
 using sim_test::okLine;
 using sim_test::scriptOf;
@@ -43,8 +48,14 @@ struct OpenResult {
 class Front : public sim_test::EngineTest {
  protected:
   void SetUp() override {
+    sim_test::resetFront();
     EngineTest::SetUp();
     se_ = sp<ZerbSimSecureElement>::make(0);
+  }
+  void TearDown() override {
+    EngineTest::TearDown();
+    sim_test::resetFront();
+    sim_test::setUptime(1000);
   }
   void initAndWait(int modems = 1) {
     callback_ = sp<StateCallback>::make();
@@ -222,26 +233,157 @@ TEST_F(Front, NewInitClosesChannelsThreeToNineteenOnly) {
 }
 
 TEST_F(Front, InitLogsAndSettlingDelay) {
-  double uptime = 0;
-  std::ifstream("/proc/uptime") >> uptime;
+  struct Case {
+    long uptime;
+    bool fails;
+    const char* uptimeLine;  // nullptr: none
+    bool sleeps;
+    int32_t timeflagAfter;
+  };
+  const Case cases[] = {
+      {60, false, "print_system_boot_time, time is 60", true, -1},
+      {-1, true, "Failed to get sysinfo\n", true, -1},
+      {120, false, "print_system_boot_time, time is 120", false, 1},
+  };
+  for (const Case& c : cases) {
+    SCOPED_TRACE(c.uptime);
+    sim_test::setUptime(c.uptime, c.fails);
+    LogCapture cap;
+    initAndWait();
+    EXPECT_TRUE(cap.contains(c.uptimeLine, kTag));
+    EXPECT_EQ(c.sleeps, cap.contains("init, SLEEP 1.5S", kTag));
+    EXPECT_EQ(c.timeflagAfter, timeflag);
+  }
+  // Once settled, a later init neither reads the uptime nor sleeps.
+  sim_test::setUptime(5, true);
   LogCapture cap;
   initAndWait();
-  EXPECT_TRUE(cap.contains("init, m_modem_id: 0", kTag));
-  EXPECT_TRUE(cap.contains("init, dual_sim = 1", kTag));
-  EXPECT_TRUE(cap.contains("init, m0 init_at_channel SUCCESS", kTag));
-  EXPECT_FALSE(cap.contains("dual_sim init second pthread", kTag));
-  EXPECT_TRUE(cap.contains("print_system_boot_time, time is ", kTag));
-  if (uptime >= 121) {
-    EXPECT_EQ(1, timeflag);
-    EXPECT_FALSE(cap.contains("init, SLEEP 1.5S", kTag));
-    // Once set, a later init does not look at the uptime again.
-    cap.clear();
-    se_->init(sp<StateCallback>::make());
-    EXPECT_FALSE(cap.contains("print_system_boot_time", kTag));
-  } else if (uptime > 0 && uptime < 119) {
-    EXPECT_EQ(-1, timeflag);
-    EXPECT_TRUE(cap.contains("init, SLEEP 1.5S", kTag));
+  EXPECT_FALSE(cap.contains("print_system_boot_time", kTag));
+  EXPECT_FALSE(cap.contains("sysinfo", kTag));
+  EXPECT_FALSE(cap.contains("SLEEP", kTag));
+}
+
+// Every line of the front goes to the radio buffer under its tag, errors at
+// error priority and the rest at debug.
+TEST_F(Front, LogLinesHaveTheirPriorityAndBuffer) {
+  LogCapture cap;
+  sp<ZerbSimSecureElement> other = sp<ZerbSimSecureElement>::make(7);
+  se_->init(nullptr);
+  initAndWait();
+  EXPECT_FALSE(se_->isCardPresent());
+  se_->openBasicChannel({0xA0}, 0, [](const hidl_vec<uint8_t>&, SecureElementStatus) {});
+  se_->serviceDied(0, nullptr);
+  root_.writeFile("properties", "persist.odm.radio.sim_slot_cfg=0\n");
+  EXPECT_FALSE(se_->isCardPresent());
+  const std::vector<std::pair<const char*, int>> expected = {
+      {"ZerbSimSecureElement, modemid 7", ANDROID_LOG_DEBUG},
+      {"init, clientCallback is NULL", ANDROID_LOG_ERROR},
+      {"init, m_modem_id: 0", ANDROID_LOG_DEBUG},
+      {"init, dual_sim = 1", ANDROID_LOG_DEBUG},
+      {"init, m0 init_at_channel SUCCESS", ANDROID_LOG_DEBUG},
+      {"isCardPresent, modem_id: 0", ANDROID_LOG_DEBUG},
+      {"openBasicChannel, not allowed open basic channel", ANDROID_LOG_ERROR},
+      {"serviceDied, enter, modem_id: 0", ANDROID_LOG_DEBUG},
+      {"isCardPresent, modem_id error: -1", ANDROID_LOG_ERROR},
+  };
+  for (const auto& e : expected) {
+    SCOPED_TRACE(e.first);
+    std::vector<android::host::LogRecord> found = cap.find(e.first, kTag);
+    ASSERT_FALSE(found.empty());
+    EXPECT_EQ(e.second, found[0].priority);
   }
+  for (const android::host::LogRecord& r : cap.find("", kTag)) {
+    EXPECT_EQ(LOG_ID_RADIO, r.buffer) << r.text;
+  }
+}
+
+// A SIM call stuck on a silent modem holds the front's lock. Further SIM
+// calls, and init's sweep, give up at once with their usual failure instead
+// of tying up the RPC threads; calls that take no lock answer as always.
+TEST_F(Front, SilentModemDoesNotHoldUpOtherCallers) {
+  se_delay::setDivisorForTest(1);  // the real silence bound
+  initAndWait();
+  std::promise<void> written;
+  std::atomic<bool> first{true};
+  std::promise<void> release;
+  std::shared_future<void> released = release.get_future().share();
+  modem0_->setScript([&, released](FakeModem& m, const std::string& cmd) {
+    if (cmd.rfind("AT+CSIM=", 0) == 0) {
+      if (first.exchange(false)) written.set_value();
+      released.wait();  // silent until the test is done
+      m.send(okLine("+CSIM: 4,\"9000\""));
+    } else if (cmd.rfind("AT+CCHC=", 0) == 0) {
+      m.send(finalLine("OK"));
+    }
+  });
+  g_simOpenedChannels[5] = 1;
+  auto stuck = std::async(std::launch::async, [&] { return transmit({0x00, 0xB0, 0x00, 0x00}); });
+  written.get_future().wait();
+  ASSERT_TRUE(waitUntil([] { return asyncCmdSilenceMicros() >= 500000; }));
+
+  LogCapture cap;
+  // Operations that take no lock are not held up at all (on a thread of
+  // their own, so that one that blocked fails the test instead of hanging it).
+  auto lockFree = std::async(std::launch::async, [&] {
+    int basic = 0;
+    se_->openBasicChannel({0xA0}, 0, [&](const hidl_vec<uint8_t>&, SecureElementStatus s) {
+      basic = s == SecureElementStatus::CHANNEL_NOT_AVAILABLE ? 1 : -1;
+    });
+    se_->serviceDied(0, nullptr);
+    return basic;
+  });
+  EXPECT_EQ(std::future_status::ready, lockFree.wait_for(at_test::kGenerous));
+  EXPECT_FALSE(cap.contains("openBasicChannel, modem silent"));
+  EXPECT_FALSE(cap.contains("serviceDied, modem silent"));
+
+  EXPECT_FALSE(se_->isCardPresent());
+  EXPECT_TRUE(atr().empty());
+  EXPECT_TRUE(transmit({0x00, 0xB0, 0x00, 0x00}).empty());
+  OpenResult r = open({0xA0, 0x00}, 0);
+  EXPECT_EQ(SecureElementStatus::FAILED, r.status);
+  EXPECT_EQ(SecureElementStatus::FAILED, static_cast<SecureElementStatus>(se_->closeChannel(5)));
+  sp<StateCallback> second = sp<StateCallback>::make();
+  se_->init(second);
+  EXPECT_EQ(std::vector<bool>{true}, second->states);
+  for (const char* op : {"isCardPresent", "getAtr", "transmit", "openLogicalChannel", "closeChannel", "init"}) {
+    SCOPED_TRACE(op);
+    std::vector<android::host::LogRecord> lines = cap.find(std::string(op) + ", modem silent for ", kTag);
+    ASSERT_EQ(1u, lines.size());
+    EXPECT_EQ(ANDROID_LOG_ERROR, lines[0].priority);
+  }
+  EXPECT_EQ(1, g_simOpenedChannels[5]);  // not closed, so still flagged
+  EXPECT_EQ(1u, modem0_->commands().size());
+
+  release.set_value();
+  EXPECT_EQ(1, lockFree.get());
+  EXPECT_EQ((std::vector<uint8_t>{0x90, 0x00}), stuck.get());
+  // The modem answers again: calls are served as before.
+  EXPECT_EQ((std::vector<uint8_t>{0x90, 0x00}), transmit({0x00, 0xB0, 0x00, 0x00}));
+}
+
+// Several callers on a working but slow modem (each answer takes 100 ms, so
+// the last caller waits far longer than the silence bound) all wait their
+// turn and get their own answers.
+TEST_F(Front, ConcurrentCallersOnAWorkingModemAreAllServed) {
+  se_delay::setDivisorForTest(1);
+  initAndWait();
+  modem0_->setScript([](FakeModem& m, const std::string& cmd) {
+    std::this_thread::sleep_for(std::chrono::milliseconds(100));  // the modem's own pace
+    const std::string hex = cmd.substr(cmd.find('"') + 1, 4);
+    m.send(okLine("+CSIM: 6,\"" + hex.substr(2, 2) + "9000\""));
+  });
+  constexpr int kCallers = 8;
+  LogCapture cap;
+  std::vector<std::future<std::vector<uint8_t>>> calls;
+  for (int i = 0; i < kCallers; i++) {
+    calls.push_back(std::async(std::launch::async, [this, i] {
+      return transmit({0x00, static_cast<uint8_t>(0x10 + i), 0x00, 0x00});
+    }));
+  }
+  for (int i = 0; i < kCallers; i++) {
+    EXPECT_EQ((std::vector<uint8_t>{static_cast<uint8_t>(0x10 + i), 0x90, 0x00}), calls[i].get());
+  }
+  EXPECT_FALSE(cap.contains("modem silent"));
 }
 
 TEST_F(Front, EachCallGoesToTheModemOfTheSwitchedSim) {
@@ -281,19 +423,16 @@ TEST_F(Front, EachCallGoesToTheModemOfTheSwitchedSim) {
   EXPECT_EQ(3u, modem0_->commands().size());
 }
 
-TEST(FrontClass, ConstructorBasicChannelAndDeath) {
+// The log lines of these are in LogLinesHaveTheirPriorityAndBuffer.
+TEST(FrontClass, ConstructorAndBasicChannel) {
   struct Case {
     int given, kept;
   };
   for (const Case& c : {Case{0, 0}, Case{1, 1}, Case{5, 0}, Case{-1, 0}}) {
-    LogCapture cap;
-    sp<ZerbSimSecureElement> se = sp<ZerbSimSecureElement>::make(c.given);
-    EXPECT_EQ(c.kept, se->modemId());
-    EXPECT_TRUE(cap.contains("ZerbSimSecureElement, modemid " + std::to_string(c.given), kTag));
+    EXPECT_EQ(c.kept, sp<ZerbSimSecureElement>::make(c.given)->modemId()) << c.given;
   }
   // Refused before any init, without touching a modem.
   sp<ZerbSimSecureElement> se = sp<ZerbSimSecureElement>::make(1);
-  LogCapture cap;
   int calls = 0;
   se->openBasicChannel({0xA0, 0x00}, 0x00, [&](const hidl_vec<uint8_t>& resp, SecureElementStatus s) {
     EXPECT_EQ(0u, resp.size());
@@ -301,10 +440,6 @@ TEST(FrontClass, ConstructorBasicChannelAndDeath) {
     calls++;
   });
   EXPECT_EQ(1, calls);
-  EXPECT_TRUE(cap.contains("openBasicChannel, not allowed open basic channel", kTag));
-  se->serviceDied(0, nullptr);
-  EXPECT_TRUE(cap.contains("serviceDied, enter, modem_id: 1", kTag));
-  EXPECT_EQ(2u, cap.records().size());
 }
 
 }  // namespace
