@@ -200,8 +200,9 @@ void handleUnsolicited(AtContext* ac, const char* line, bool lockHeld) {
   t_inLockedHandler = false;
 }
 
-// Sorts one line; command_lock is held.
-void processLine(AtContext* ac, const char* line) {
+// Sorts one line; command_lock is held. True when it ended the command in
+// flight: the caller wakes the sender once it has let go of the lock.
+bool processLine(AtContext* ac, const char* line) {
   ATResponse* r = ac->response;
   // Once the final response is in, the command takes no more lines, even if
   // its sender has not woken yet.
@@ -215,8 +216,7 @@ void processLine(AtContext* ac, const char* line) {
       at_note_answer(ac->index);
       r->success = kind == AT_KIND_FINAL_SUCCESS ? 1 : 0;
       r->final_response = strdup(line);
-      pthread_cond_signal(&ac->command_cond);
-      break;
+      return true;
     case AT_KIND_INTERMEDIATE: {
       at_note_answer(ac->index);
       auto* node = static_cast<ATResponseLine*>(calloc(1, sizeof(ATResponseLine)));
@@ -235,6 +235,7 @@ void processLine(AtContext* ac, const char* line) {
       handleUnsolicited(ac, line, true);
       break;
   }
+  return false;
 }
 
 int32_t readPort(void* arg, char* dest, int32_t max_len) {
@@ -407,8 +408,15 @@ void* readerLoop(AtContext* ac) {
       if (ac->unsol_handler != nullptr) ac->unsol_handler(first.get(), second);
       continue;
     }
-    MutexGuard g(&ac->command_lock);
-    processLine(ac, line);
+    bool ended;
+    {
+      MutexGuard g(&ac->command_lock);
+      ended = processLine(ac, line);
+    }
+    // After the unlock: the sender does not wake only to wait for the lock.
+    // Its condition was set under the lock, so a late or spare signal finds
+    // it either gone or still waiting with reason.
+    if (ended) pthread_cond_signal(&ac->command_cond);
   }
   readerGone(ac);
   return nullptr;

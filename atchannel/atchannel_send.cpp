@@ -21,6 +21,8 @@ namespace {
 constexpr uint64_t kCommandTimeoutMicros = 600ULL * 1000000ULL;
 constexpr uint64_t kWriteRetryMicros = 1000000ULL;
 constexpr int32_t kWriteAttempts = 5;
+// Command lines up to this long (with CR) are written from the stack.
+constexpr size_t kStackLineSize = 1024;
 
 // Per modem slot: when the pending command started (monotonic microseconds,
 // 0 while none is pending) and when a line of its answer last came. Written
@@ -86,16 +88,24 @@ int32_t writeAttempt(const char* s, size_t len, const struct timespec* deadline)
   } else {
     AT_LOGI("m%d_%d>%s\n", ac->index, ac->fd, s);
   }
+  // The line and its CR in one write; on the stack when it fits, as every
+  // command of the SIM requests does.
   size_t size = len + 2;
-  CharBuf buf(static_cast<char*>(calloc(size, 1)));
-  if (!buf) {
-    AT_LOGD("malloc tmp failed\n");
-    return -1;
+  char stackLine[kStackLineSize];
+  CharBuf heapLine;
+  char* line = stackLine;
+  if (size > sizeof(stackLine)) {
+    heapLine.reset(static_cast<char*>(calloc(size, 1)));
+    if (!heapLine) {
+      AT_LOGD("malloc tmp failed\n");
+      return -1;
+    }
+    line = heapLine.get();
   }
-  if (snprintf_s(buf.get(), size, size - 1, "%s\r", s) != static_cast<int>(len + 1)) return -1;
+  if (snprintf_s(line, size, size - 1, "%s\r", s) != static_cast<int>(len + 1)) return -1;
   size_t done = 0;
   while (done < len + 1) {
-    ssize_t n = write(ac->fd, buf.get() + done, len + 1 - done);
+    ssize_t n = write(ac->fd, line + done, len + 1 - done);
     if (n < 0 && errno == EINTR) continue;
     if (n < 0 && (errno == EAGAIN || errno == EWOULDBLOCK)) {
       struct pollfd pfd = {ac->fd, POLLOUT, 0};

@@ -13,7 +13,10 @@
 //     port, without the daemon;
 //   - one SIM call's modem choice (communication_which_modem, in a helper
 //     process that resolves paths under the same device root);
-//   - start-up: launch until both instances accept connections.
+//   - start-up: launch until both instances accept connections;
+//   - the transports alone: a Unix-socket round trip between two processes
+//     with the frames' sizes of those calls, and a pty round trip with the
+//     AT texts' sizes (floors.h).
 // The cases take turns exchange by exchange, in a shuffled order each turn,
 // so that load from other processes, and the machine's changing wake-up
 // latency, fall on floors and daemon paths alike and the ratios hold.
@@ -31,6 +34,7 @@
 
 #include <android/hardware/secure_element/1.0/ISecureElement.h>
 #include <host/rpc_host.h>
+#include <host/rpc_wire.h>
 
 #include <cerrno>
 #include <cstdio>
@@ -49,6 +53,7 @@
 #include "bench_util.h"
 #include "card_applets.h"
 #include "ese_qv_hal.h"
+#include "floors.h"
 
 using ::android::sp;
 using ::android::hardware::hidl_vec;
@@ -369,6 +374,37 @@ std::string hexOf(const Bytes& b) {
   return s;
 }
 
+// The frames of one call on the wire: the call with `args`, the reply
+// with `result` (the RPC host's encoding, so the floor moves the same bytes).
+se_bench::Exchange frameExchange(uint32_t code, const Bytes* args, const Bytes* result, uint8_t flag) {
+  using ::android::host::rpc::BodyWriter;
+  using ::android::host::rpc::Frame;
+  using ::android::host::rpc::FrameKind;
+  Frame call, reply;
+  call.kind = FrameKind::Call;
+  call.id = reply.id = 1;
+  call.code = code;
+  reply.kind = FrameKind::Reply;
+  BodyWriter a, r;
+  if (args) a.bytes(args->data(), args->size());
+  if (result) {
+    r.bytes(result->data(), result->size());
+  } else {
+    r.u8(flag);
+  }
+  call.body = a.take();
+  reply.body = r.take();
+  se_bench::Exchange e;
+  if (!::android::host::rpc::encodeFrame(call, &e.request) || !::android::host::rpc::encodeFrame(reply, &e.answer)) {
+    fail("cannot encode the floor's frames");
+  }
+  return e;
+}
+
+se_bench::Exchange textExchange(const std::string& request, const std::string& answer) {
+  return {Bytes(request.begin(), request.end()), Bytes(answer.begin(), answer.end())};
+}
+
 // ---------------------------------------------------------------------------
 // The daemon over its sockets
 
@@ -661,6 +697,22 @@ int main(int argc, char** argv) {
     modemAnswers.push_back("+CGLA: " + std::to_string(rsp.size()) + ",\"" + rsp + "\"");
   }
 
+  // The transport floors: exchange 0 the isCardPresent frames, 1 and 2 the
+  // transmit frames of case-2 and case-4; on the pty the AT texts of the
+  // two cases, as a modem answers them.
+  se_bench::EchoFloor socketFloor, ptyFloor;
+  {
+    std::vector<se_bench::Exchange> frames = {frameExchange(3, nullptr, nullptr, 1)};
+    std::vector<se_bench::Exchange> texts;
+    for (int k = 0; k < 2; ++k) {
+      frames.push_back(frameExchange(4, &simCases[k].command, &simCases[k].response, 0));
+      texts.push_back(textExchange(modemCommands[k] + "\r", modemAnswers[k] + "\r\nOK\r\n"));
+    }
+    if (!socketFloor.startSocket(frames) || !ptyFloor.startPty(texts)) fail("cannot start the transport floors");
+    g_children.push_back(socketFloor.pid());
+    g_children.push_back(ptyFloor.pid());
+  }
+
   auto viaRpc = [](const sp<ISecureElement>& se, const Case& c) {
     bool same = false;
     auto r = se->transmit(c.command, [&](const hidl_vec<uint8_t>& rsp) {
@@ -676,11 +728,18 @@ int main(int argc, char** argv) {
 
   Series rpcFloor;
   Series libFloor[2], modemFloor[2], eseTx[2], simTx[2];
+  Series socketRpc, socketTx[2], ptyTx[2];
   std::vector<Probe> probes;
   probes.push_back({"isCardPresent", &rpcFloor, [&] {
                       auto r = ese->isCardPresent();
                       return r.isOk() && static_cast<bool>(r);
                     }});
+  probes.push_back({"socket isCardPresent", &socketRpc, [&] { return socketFloor.roundTrip(0); }});
+  for (int k = 0; k < 2; ++k) {
+    probes.push_back({std::string("socket ") + simCases[k].name, &socketTx[k],
+                      [&, k] { return socketFloor.roundTrip(1 + k); }});
+    probes.push_back({std::string("pty ") + simCases[k].name, &ptyTx[k], [&, k] { return ptyFloor.roundTrip(k); }});
+  }
   for (int k = 0; k < 2; ++k) {
     probes.push_back({std::string("library ") + libCases[k].name, &libFloor[k],
                       [&, k] { return lib.transmit(libCases[k].command) == libCases[k].response; }});
@@ -754,6 +813,9 @@ int main(int argc, char** argv) {
   printf("| %-52s | %6s | %9s | %9s | %8s |\n", "measurement", "n", "median us", "p99 us", "per s");
   printf("|%s|%s|%s|%s|%s|\n", std::string(54, '-').c_str(), std::string(8, '-').c_str(),
          std::string(11, '-').c_str(), std::string(11, '-').c_str(), std::string(10, '-').c_str());
+  row("socket round trip: isCardPresent frames", socketRpc.stats());
+  for (int k = 0; k < 2; ++k) row(std::string("socket round trip: transmit ") + simCases[k].name, socketTx[k].stats());
+  for (int k = 0; k < 2; ++k) row(std::string("pty round trip: AT+CGLA text ") + simCases[k].name, ptyTx[k].stats());
   row("RPC floor: isCardPresent on eSE1", rpcFloor.stats());
   for (int k = 0; k < 2; ++k) row(std::string("library floor: ") + libCases[k].name, libFloor[k].stats());
   for (int k = 0; k < 2; ++k) row(std::string("modem floor: AT+CGLA ") + modemCases[k].name, modemFloor[k].stats());
@@ -772,6 +834,17 @@ int main(int argc, char** argv) {
   }
   printf("| %-52s | %14.2f | %14.2f |\n", "eSE1 transmit / (RPC floor + library floor)", eseRatio[0], eseRatio[1]);
   printf("| %-52s | %14.2f | %14.2f |\n", "SIM1 transmit / (RPC floor + modem floor)", simRatio[0], simRatio[1]);
+  // Against the transports alone.
+  const double socketRpcUs = socketRpc.stats().medianUs;
+  printf("| %-52s | %14.2f | %14s |\n", "RPC floor / socket round trip", rpc / socketRpcUs, "");
+  for (int k = 0; k < 2; ++k) {
+    eseRatio[k] = eseTx[k].stats().medianUs / (socketTx[k].stats().medianUs + libFloor[k].stats().medianUs);
+    simRatio[k] = simTx[k].stats().medianUs / (socketTx[k].stats().medianUs + ptyTx[k].stats().medianUs);
+  }
+  printf("| %-52s | %14.2f | %14.2f |\n", "eSE1 transmit / (socket round trip + library floor)", eseRatio[0],
+         eseRatio[1]);
+  printf("| %-52s | %14.2f | %14.2f |\n", "SIM1 transmit / (socket round trip + pty round trip)", simRatio[0],
+         simRatio[1]);
 
 
   // Where a SIM1 exchange spends what the floors do not explain.
@@ -799,6 +872,8 @@ int main(int argc, char** argv) {
   // The client's connections go before the daemon.
   ese.clear();
   sim.clear();
+  socketFloor.stop();
+  ptyFloor.stop();
   daemon.stop();
   modem.stop();
   floorModem.stop();

@@ -219,7 +219,11 @@ bool serve(AsyncCmdChannel* ch, int32_t id, bool watchPort) {
     ch->handler();
     g_asyncCmd.modem_id = id;
     g_asyncCmd.state = CMD_STATE_RESPONSE;
+    // The caller's condition is set under the lock; it is woken once the
+    // lock is free, so it does not wake only to wait for this thread.
+    pthread_mutex_unlock(&ch->mutex);
     pthread_cond_signal(&ch->resp_cond);
+    pthread_mutex_lock(&ch->mutex);
   }
 }
 
@@ -414,7 +418,12 @@ int32_t asyncCmdPush(int32_t modem_id, int32_t request, const uint8_t* data, int
     (void)memcpy_s(g_asyncCmd.data, sizeof(g_asyncCmd.data), data, static_cast<size_t>(datalen));
   }
   g_asyncCmd.state = CMD_STATE_REQUEST;
+  // Posted under the lock, signalled once it is free: the worker takes the
+  // lock without waiting for this thread to sleep. Only one caller posts at
+  // a time (the front's lock), so the record stays as it is meanwhile.
+  pthread_mutex_unlock(&ch.mutex);
   pthread_cond_broadcast(&ch.req_cond);
+  pthread_mutex_lock(&ch.mutex);
   while (!(g_asyncCmd.state == CMD_STATE_RESPONSE && g_asyncCmd.modem_id == modem_id)) {
     pthread_cond_wait(&ch.resp_cond, &ch.mutex);
   }

@@ -1,6 +1,7 @@
 // Generic RPC transport over Unix-domain stream sockets: registration of
-// instances, the server's I/O thread and call pool, server connections with
-// their death links, and the client connection. Knows frames and object ids,
+// instances, the server's pool (whose threads take turns reading and run the
+// calls they read), server connections with their death links, and the
+// client connection. Knows frames and object ids,
 // not the interfaces carried over them.
 #include "rpc_internal.h"
 
@@ -13,6 +14,8 @@
 #include <dirent.h>
 #include <fcntl.h>
 #include <poll.h>
+#include <sys/epoll.h>
+#include <sys/eventfd.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/un.h>
@@ -54,12 +57,16 @@ namespace {
 using hidl::base::V1_0::IBase;
 
 constexpr size_t kMaxConnections = 256;
-// Calls of one connection queued or running at once; beyond this the I/O
-// thread stops reading that connection until some finish.
+// Calls of one connection queued or running at once; beyond this the pool
+// stops reading that connection until some finish.
 constexpr int kMaxInflightPerConnection = 8;
 // A peer that accepts no bytes of a reply for this long is dropped.
 constexpr int kWriteStallMs = 10000;
 constexpr size_t kReadChunk = 65536;
+// Events a pool thread takes from the kernel at once.
+constexpr int kEventsAtOnce = 32;
+// Reads of a connection whose peer has stopped sending, in one turn.
+constexpr int kReadRoundsToEnd = 64;
 
 class UniqueFd {
  public:
@@ -193,20 +200,37 @@ bool makeDirs(const std::string& dir) {
 // ---------------------------------------------------------------------------
 // Server side
 
+class ServerConn;
+// A thread in a call to a client waits for the answer by reading the
+// client's connection itself (defined with the pool below): the pool's
+// threads may all be busy.
+void readWhileWaiting(const std::shared_ptr<ServerConn>& conn, int wakeFd);
+
 class ServerConn : public RemotePeer, public std::enable_shared_from_this<ServerConn> {
  public:
-  ServerConn(UniqueFd fd, std::string name, sp<IBase> service, StubFn stub, pid_t pid)
+  ServerConn(UniqueFd fd, std::string name, sp<IBase> service, StubFn stub, pid_t pid,
+             uint64_t id)
       : mFd(std::move(fd)),
         mName(std::move(name)),
         mService(std::move(service)),
         mStub(stub),
-        mPid(pid) {}
+        mPid(pid),
+        mId(id) {}
 
   int fd() const { return mFd.get(); }
   const std::string& name() const { return mName; }
   pid_t pid() const { return mPid; }
-  FrameDecoder& decoder() { return mDecoder; }
-  std::atomic<int> inflight{0};
+  uint64_t id() const { return mId; }
+
+  // Whoever reads the connection holds readLock: the decoder and
+  // readClosed are theirs.
+  std::mutex readLock;
+  FrameDecoder decoder;
+  bool readClosed = false;
+  // Under the pool's lock: calls queued or running, and whether reading
+  // waits for some of them to finish.
+  int inflight = 0;
+  bool parked = false;
 
   // Runs one incoming call on a pool thread.
   void serveCall(const Frame& f) {
@@ -254,13 +278,16 @@ class ServerConn : public RemotePeer, public std::enable_shared_from_this<Server
     if (it == mPending.end() || it->second->done) return false;
     it->second->frame = std::move(f);
     it->second->done = true;
-    mCv.notify_all();
+    // Under the lock: the waiting call closes its descriptor once it sees
+    // the answer.
+    poke(it->second->wakeFd);
     return true;
   }
 
-  // The connection ended (I/O thread only): wakes waiting calls, closes the
-  // socket and hands back the death links. The service reference goes too:
-  // the service may keep this client's callback proxy, which refers back here.
+  // The connection ended (by whoever holds readLock): ends waiting calls,
+  // closes the socket and hands back the death links. The service
+  // reference goes too: the service may keep this client's callback proxy,
+  // which refers back here.
   std::vector<DeathLink> markClosed() {
     std::vector<DeathLink> links;
     std::map<uint32_t, wp<IBase>> proxies;
@@ -272,7 +299,7 @@ class ServerConn : public RemotePeer, public std::enable_shared_from_this<Server
       proxies.swap(mProxies);
       service = mService;
       mService = nullptr;
-      mCv.notify_all();
+      for (auto& p : mPending) poke(p.second->wakeFd);
     }
     // Unblocks a writer waiting on a full socket before taking its lock.
     shutdown(mFd.get(), SHUT_RDWR);
@@ -281,7 +308,7 @@ class ServerConn : public RemotePeer, public std::enable_shared_from_this<Server
     return links;
   }
 
-  // Ends the connection from a pool thread; the I/O thread then sees the
+  // Ends the connection from a pool thread; whoever reads it next sees the
   // hang-up and cleans up.
   void abort() {
     std::lock_guard<std::mutex> g(mWriteLock);
@@ -291,7 +318,11 @@ class ServerConn : public RemotePeer, public std::enable_shared_from_this<Server
   hardware::Status call(uint32_t object, uint32_t method, const BodyWriter& args,
                         std::vector<uint8_t>* reply) override {
     if (!args.ok()) return transportError("arguments exceed the frame limit");
+    // Tells this thread that a pool thread read its answer (or the end).
+    UniqueFd wake(eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK));
+    if (wake.get() < 0) return transportError("cannot wait for the client");
     auto pending = std::make_shared<Pending>();
+    pending->wakeFd = wake.get();
     Frame f;
     {
       std::lock_guard<std::mutex> g(mLock);
@@ -310,11 +341,17 @@ class ServerConn : public RemotePeer, public std::enable_shared_from_this<Server
       mPending.erase(f.id);
       return transportError("cannot send to client");
     }
-    std::unique_lock<std::mutex> lk(mLock);
-    mCv.wait(lk, [&] { return pending->done || mClosed; });
-    mPending.erase(f.id);
+    for (;;) {
+      {
+        std::lock_guard<std::mutex> g(mLock);
+        if (pending->done || mClosed) {
+          mPending.erase(f.id);
+          break;
+        }
+      }
+      readWhileWaiting(shared_from_this(), wake.get());
+    }
     if (!pending->done) return transportError("client connection closed");
-    lk.unlock();
     return statusOfAnswer(pending->frame, reply);
   }
 
@@ -362,22 +399,29 @@ class ServerConn : public RemotePeer, public std::enable_shared_from_this<Server
   struct Pending {
     bool done = false;
     Frame frame;
+    int wakeFd = -1;  // owned by the waiting call; valid while it is pending
   };
+
+  static void poke(int fd) {
+    if (fd < 0) return;
+    uint64_t one = 1;
+    ssize_t unused = write(fd, &one, sizeof(one));
+    (void)unused;
+  }
 
   bool send(const Frame& f) {
     std::lock_guard<std::mutex> g(mWriteLock);
     return mFd.get() >= 0 && sendFrame(mFd.get(), f, kWriteStallMs);
   }
 
-  UniqueFd mFd;  // closed by the I/O thread only, under mWriteLock
+  UniqueFd mFd;  // closed under readLock and mWriteLock
   const std::string mName;
   sp<IBase> mService;  // null once closed
   const StubFn mStub;
   const pid_t mPid;
-  FrameDecoder mDecoder;  // I/O thread only
+  const uint64_t mId;
   std::mutex mWriteLock;  // keeps frames whole
   std::mutex mLock;
-  std::condition_variable mCv;
   bool mClosed = false;
   uint32_t mNextId = 0;
   std::map<uint32_t, std::shared_ptr<Pending>> mPending;
@@ -393,6 +437,23 @@ struct Listener {
   StubFn stub = nullptr;
 };
 
+// Work for a pool thread: a call read from a connection, or a death notice.
+struct Task {
+  std::shared_ptr<ServerConn> conn;  // set: run `frame` as a call on it
+  Frame frame;
+  DeathLink death{};  // else: tell this recipient
+};
+
+// The server's pool. There is no I/O thread: the idle pool threads all wait
+// for input in one epoll set, and the kernel wakes one of them per event.
+// Every socket is armed for one event at a time, so one thread reads a
+// connection at once; it arms it again once it has read, then runs the
+// call it read itself. A call therefore costs no hand-over between threads
+// and no thread is woken but the one that runs it. At most mMaxThreads
+// calls (and death notices) run at once, the joining thread being one of
+// the pool; calls beyond that wait in the queue. A thread in a call to a
+// client reads that client's connection itself while it waits for the
+// answer, so the answer is read even when every pool thread is busy.
 class Host {
  public:
   static Host& get() {
@@ -405,7 +466,6 @@ class Host {
     mMaxThreads = maxThreads == 0 ? 1 : maxThreads;
     mCallerJoins = callerWillJoin;
     if (mRunning) spawnWorkersLocked();
-    mTaskCv.notify_all();
   }
 
   // Listens for `name` in the socket folder `dir`: HIDL and AIDL instances
@@ -456,15 +516,18 @@ class Host {
     l->service = service;
     l->stub = stub;
     mListeners.push_back(std::move(l));
-    startLocked();
-    wake();
+    if (!startLocked()) return UNKNOWN_ERROR;
+    if (!control(EPOLL_CTL_ADD, mListeners.back()->fd.get(), listenerKey(mListeners.size() - 1))) {
+      RPC_LOGE("cannot poll %s: %s", path.c_str(), strerror(errno));
+      return UNKNOWN_ERROR;
+    }
     return OK;
   }
 
   void join() {
     {
       std::lock_guard<std::mutex> g(mLock);
-      startLocked();
+      if (!startLocked()) return;
       ++mActiveJoiners;
     }
     workerLoop();
@@ -473,39 +536,72 @@ class Host {
     mJoinCv.notify_all();
   }
 
-  void queue(std::function<void()> task) {
+  // A call on `c` waits for its answer: reads what the connection has, then
+  // waits until it has more or `wakeFd` tells that a pool thread read it.
+  // A connection with its most calls queued is not read here either; only
+  // its end is watched for.
+  void readWhileWaiting(const std::shared_ptr<ServerConn>& c, int wakeFd) {
+    bool full;
     {
       std::lock_guard<std::mutex> g(mLock);
-      if (mStopping) return;
-      mTasks.push_back(std::move(task));
+      full = c->inflight >= kMaxInflightPerConnection;
     }
-    // Woken after the unlock, the pool thread finds the lock free.
-    mTaskCv.notify_one();
-  }
-
-  void wake() {
-    int fd = mWakeWrite.load();
-    if (fd >= 0) {
-      char b = 1;
-      ssize_t unused = write(fd, &b, 1);
+    std::vector<Task> fresh;
+    int fd = -1;
+    {
+      std::lock_guard<std::mutex> rg(c->readLock);
+      if (!c->readClosed) {
+        fd = c->fd();
+        if (!full && !readConn(c, &fresh, false)) {
+          closeConnLocked(c, &fresh);
+          fd = -1;
+        }
+      }
+    }
+    if (!fresh.empty()) queue(fresh);
+    if (fd < 0) return;  // closed: the caller sees it
+    pollfd p[2] = {{fd, static_cast<short>(full ? 0 : POLLIN), 0}, {wakeFd, POLLIN, 0}};
+    if (poll(p, 2, -1) <= 0) return;
+    if (p[1].revents) {
+      uint64_t drain;
+      ssize_t unused = read(wakeFd, &drain, sizeof(drain));
       (void)unused;
+    }
+    if (full && (p[0].revents & (POLLHUP | POLLERR))) {
+      {
+        std::lock_guard<std::mutex> rg(c->readLock);
+        if (!c->readClosed) closeConnLocked(c, &fresh);
+      }
+      if (!fresh.empty()) queue(fresh);
     }
   }
 
   void shutdownHost() {
-    std::thread io;
     std::vector<std::thread> workers;
+    std::map<uint64_t, std::shared_ptr<ServerConn>> conns;
     {
-      std::lock_guard<std::mutex> g(mLock);
+      std::unique_lock<std::mutex> lk(mLock);
       mStopping = true;
-      mTaskCv.notify_all();
-      io = std::move(mIo);
+      // Level-triggered and never drained: every waiting thread sees it.
+      if (mStopFd.get() >= 0) {
+        uint64_t one = 1;
+        ssize_t unused = write(mStopFd.get(), &one, sizeof(one));
+        (void)unused;
+      }
       workers.swap(mWorkers);
+      // Threads that read from sockets finish first; nobody starts again.
+      mJoinCv.wait(lk, [&] { return mHandling == 0; });
+      conns.swap(mConns);
     }
-    wake();
-    if (io.joinable()) io.join();
+    // Stopping: no death notices, just end whatever waits on these clients.
+    for (auto& c : conns) {
+      std::lock_guard<std::mutex> rg(c.second->readLock);
+      c.second->readClosed = true;
+      c.second->markClosed();
+    }
+    conns.clear();
     for (auto& w : workers) w.join();
-    std::deque<std::function<void()>> dropped;
+    std::deque<Task> dropped;
     std::vector<std::unique_ptr<Listener>> listeners;
     {
       std::unique_lock<std::mutex> lk(mLock);
@@ -516,9 +612,9 @@ class Host {
       mBusy = 0;
       mRunning = false;
       mStopping = false;
-      int wr = mWakeWrite.exchange(-1);
-      if (wr >= 0) close(wr);
-      mWakeRead.reset();
+      mEpoll.reset();
+      mStopFd.reset();
+      mWorkFd.reset();
     }
     for (auto& l : listeners) unlink(l->path.c_str());
   }
@@ -526,19 +622,43 @@ class Host {
  private:
   Host() = default;
 
-  void startLocked() {
+  // What an epoll event stands for: the low two bits the kind, the rest a
+  // connection id or a listener's index.
+  enum Kind : uint64_t { kConn = 0, kListener = 1, kStop = 2, kWork = 3 };
+  static uint64_t listenerKey(size_t index) { return (uint64_t(index) << 2) | kListener; }
+  // A connection is armed for input and for its peer's end of sending.
+  static constexpr uint32_t kConnEvents = EPOLLIN | EPOLLRDHUP | EPOLLONESHOT;
+
+  // Arms `fd` for one event.
+  bool control(int op, int fd, uint64_t key, uint32_t events = EPOLLIN | EPOLLONESHOT) {
+    epoll_event ev{};
+    ev.events = events;
+    ev.data.u64 = key;
+    return epoll_ctl(mEpoll.get(), op, fd, &ev) == 0;
+  }
+
+  bool startLocked() {
     if (!mRunning) {
-      int p[2];
-      if (pipe2(p, O_NONBLOCK | O_CLOEXEC) != 0) {
-        RPC_LOGE("cannot create the wake pipe: %s", strerror(errno));
-        return;
+      UniqueFd ep(epoll_create1(EPOLL_CLOEXEC));
+      UniqueFd stop(eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK));
+      UniqueFd work(eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK));
+      if (ep.get() < 0 || stop.get() < 0 || work.get() < 0) {
+        RPC_LOGE("cannot set up the pool: %s", strerror(errno));
+        return false;
       }
-      mWakeRead.reset(p[0]);
-      mWakeWrite.store(p[1]);
+      mEpoll = std::move(ep);
+      mStopFd = std::move(stop);
+      mWorkFd = std::move(work);
+      if (!control(EPOLL_CTL_ADD, mStopFd.get(), kStop, EPOLLIN) ||
+          !control(EPOLL_CTL_ADD, mWorkFd.get(), kWork)) {
+        RPC_LOGE("cannot set up the pool: %s", strerror(errno));
+        mEpoll.reset();
+        return false;
+      }
       mRunning = true;
-      mIo = std::thread([this] { ioLoop(); });
     }
     spawnWorkersLocked();
+    return true;
   }
 
   void spawnWorkersLocked() {
@@ -549,79 +669,240 @@ class Host {
     }
   }
 
-  // Pool threads; at most mMaxThreads tasks run at once whoever serves them.
+  // Pool threads and joiners: run what is queued, else wait for input.
   void workerLoop() {
     std::unique_lock<std::mutex> lk(mLock);
+    Task task;
     for (;;) {
-      mTaskCv.wait(lk, [&] { return mStopping || (!mTasks.empty() && mBusy < mMaxThreads); });
-      if (mStopping) return;
-      std::function<void()> task = std::move(mTasks.front());
-      mTasks.pop_front();
-      ++mBusy;
+      if (mStopping || !mRunning) return;
+      if (!mTasks.empty() && mBusy < mMaxThreads) {
+        task = std::move(mTasks.front());
+        mTasks.pop_front();
+        ++mBusy;
+        const bool more = !mTasks.empty() && mBusy < mMaxThreads && mWaiting > 0;
+        lk.unlock();
+        if (more) signalWork();
+        run(task, lk);
+        continue;
+      }
+      const int ep = mEpoll.get();
+      ++mWaiting;
       lk.unlock();
-      task();
-      task = nullptr;
+      // All that is ready at once: what is taken together is handled in
+      // one go, and a call read here runs here, now, unless the pool is
+      // full (the loop's top takes it).
+      epoll_event evs[kEventsAtOnce];
+      int n = epoll_wait(ep, evs, kEventsAtOnce, -1);
+      lk.lock();
+      --mWaiting;
+      for (int i = 0; i < n && !mStopping; ++i) handle(evs[i], lk);
+    }
+  }
+
+  // Runs `task` counted as busy (the lock is released meanwhile) and
+  // returns with the lock held.
+  void run(Task& task, std::unique_lock<std::mutex>& lk) {
+    if (lk.owns_lock()) lk.unlock();
+    if (task.conn == nullptr) {
+      if (task.death.recipient != nullptr) {
+        task.death.recipient->serviceDied(task.death.cookie, task.death.who);
+      }
+      task = Task();
       lk.lock();
       --mBusy;
-      // Only a task held back by the limit needs another thread now; waking
-      // an idle one for nothing costs a context switch per call.
-      if (!mTasks.empty()) mTaskCv.notify_one();
+      return;
     }
+    task.conn->serveCall(task.frame);
+    std::shared_ptr<ServerConn> c = std::move(task.conn);
+    task = Task();
+    lk.lock();
+    --mBusy;
+    if (--c->inflight < kMaxInflightPerConnection && c->parked) {
+      c->parked = false;
+      armLocked(*c);
+    }
+    lk.unlock();
+    c.reset();  // the last reference may go here; not under the lock
+    lk.lock();
   }
 
-  void acceptOne(Listener* l, std::vector<std::shared_ptr<ServerConn>>& conns) {
-    UniqueFd fd(accept4(l->fd.get(), nullptr, nullptr, SOCK_NONBLOCK | SOCK_CLOEXEC));
-    if (fd.get() < 0) return;
-    ucred cred{};
-    socklen_t len = sizeof(cred);
-    if (getsockopt(fd.get(), SOL_SOCKET, SO_PEERCRED, &cred, &len) != 0) {
-      RPC_LOGE("refused connection to %s: peer credentials unknown", l->name.c_str());
+  // One event, with the lock held on entry and return; calls and death
+  // notices go to the queue.
+  void handle(const epoll_event& ev, std::unique_lock<std::mutex>& lk) {
+    const uint64_t key = ev.data.u64;
+    switch (key & 3) {
+      case kStop:
+        return;
+      case kWork: {
+        uint64_t drain;
+        ssize_t unused = read(mWorkFd.get(), &drain, sizeof(drain));
+        (void)unused;
+        control(EPOLL_CTL_MOD, mWorkFd.get(), kWork);
+        return;  // the loop takes what is queued
+      }
+      case kListener: {
+        size_t index = static_cast<size_t>(key >> 2);
+        if (index >= mListeners.size()) return;
+        Listener* l = mListeners[index].get();
+        ++mHandling;
+        lk.unlock();
+        acceptSome(l);
+        lk.lock();
+        doneHandling();
+        if (!mStopping) control(EPOLL_CTL_MOD, l->fd.get(), key);
+        return;
+      }
+      default:
+        break;
+    }
+    auto it = mConns.find(key >> 2);
+    if (it == mConns.end()) return;  // closed meanwhile
+    std::shared_ptr<ServerConn> c = it->second;
+    if (c->inflight >= kMaxInflightPerConnection) {
+      // Read again once some of its calls have finished.
+      c->parked = true;
       return;
     }
-    if (cred.uid != geteuid() && cred.uid != 0) {
-      RPC_LOGE("refused connection to %s from uid %u (pid %d)", l->name.c_str(),
-               static_cast<unsigned>(cred.uid), static_cast<int>(cred.pid));
-      return;
-    }
-    if (conns.size() >= kMaxConnections) {
-      RPC_LOGE("refused connection to %s from pid %d: too many connections", l->name.c_str(),
-               static_cast<int>(cred.pid));
-      return;
-    }
-    sp<IBase> service;
-    StubFn stub;
+    ++mHandling;
+    lk.unlock();
+    // Kept per thread: one read per call, and its storage need not be
+    // allocated anew each time.
+    thread_local std::vector<Task> fresh;
+    bool alive;
     {
-      std::lock_guard<std::mutex> g(mLock);
-      service = l->service;
-      stub = l->stub;
+      std::lock_guard<std::mutex> rg(c->readLock);
+      if (c->readClosed) {
+        relock(lk);
+        return;
+      }
+      alive = readConn(c, &fresh, (ev.events & (EPOLLRDHUP | EPOLLHUP)) != 0);
+      if (!alive) closeConnLocked(c, &fresh);
     }
-    conns.push_back(std::make_shared<ServerConn>(std::move(fd), l->name, service, stub, cred.pid));
+    lk.lock();
+    doneHandling();
+    for (Task& t : fresh) {
+      if (t.conn) ++t.conn->inflight;
+      mTasks.push_back(std::move(t));
+    }
+    fresh.clear();
+    if (alive) armLocked(*c);
+    if (c.use_count() == 1) {
+      // The last reference: the connection goes, not under the lock.
+      lk.unlock();
+      c.reset();
+      lk.lock();
+    }
   }
 
-  // Reads what is there; false when the connection is to be closed.
-  bool readConn(const std::shared_ptr<ServerConn>& c, std::vector<uint8_t>& buf) {
-    ssize_t n = recv(c->fd(), buf.data(), buf.size(), MSG_DONTWAIT);
+  // Lets the next event of `c` in, or parks it while it has its most calls
+  // queued or running. Only while it is in the set: once out, its socket
+  // may be closed and its number given to another.
+  void armLocked(ServerConn& c) {
+    if (mStopping || mConns.count(c.id()) == 0) return;
+    if (c.inflight >= kMaxInflightPerConnection) {
+      c.parked = true;
+      return;
+    }
+    control(EPOLL_CTL_MOD, c.fd(), (c.id() << 2) | kConn, kConnEvents);
+  }
+
+  void relock(std::unique_lock<std::mutex>& lk) {
+    lk.lock();
+    doneHandling();
+  }
+
+  void doneHandling() {
+    if (--mHandling == 0 && mStopping) mJoinCv.notify_all();
+  }
+
+  // Queues tasks read by a thread that cannot run them (it is in a call).
+  void queue(std::vector<Task>& fresh) {
+    std::vector<Task> dropped;  // released outside the lock
+    std::lock_guard<std::mutex> g(mLock);
+    if (mStopping || !mRunning) {
+      dropped.swap(fresh);
+      return;
+    }
+    for (Task& t : fresh) {
+      if (t.conn) ++t.conn->inflight;
+      mTasks.push_back(std::move(t));
+    }
+    fresh.clear();
+    if (mBusy < mMaxThreads && mWaiting > 0) signalWork();
+  }
+
+  // Wakes one waiting pool thread to take queued work.
+  void signalWork() {
+    uint64_t one = 1;
+    ssize_t unused = write(mWorkFd.get(), &one, sizeof(one));
+    (void)unused;
+  }
+
+  void acceptSome(Listener* l) {
+    for (int i = 0; i < 16; ++i) {
+      UniqueFd fd(accept4(l->fd.get(), nullptr, nullptr, SOCK_NONBLOCK | SOCK_CLOEXEC));
+      if (fd.get() < 0) return;
+      ucred cred{};
+      socklen_t len = sizeof(cred);
+      if (getsockopt(fd.get(), SOL_SOCKET, SO_PEERCRED, &cred, &len) != 0) {
+        RPC_LOGE("refused connection to %s: peer credentials unknown", l->name.c_str());
+        continue;
+      }
+      if (cred.uid != geteuid() && cred.uid != 0) {
+        RPC_LOGE("refused connection to %s from uid %u (pid %d)", l->name.c_str(),
+                 static_cast<unsigned>(cred.uid), static_cast<int>(cred.pid));
+        continue;
+      }
+      std::lock_guard<std::mutex> g(mLock);
+      if (mConns.size() >= kMaxConnections) {
+        RPC_LOGE("refused connection to %s from pid %d: too many connections", l->name.c_str(),
+                 static_cast<int>(cred.pid));
+        continue;
+      }
+      const uint64_t id = ++mNextConnId;
+      int raw = fd.get();
+      auto c = std::make_shared<ServerConn>(std::move(fd), l->name, l->service, l->stub,
+                                            cred.pid, id);
+      mConns[id] = c;
+      if (!control(EPOLL_CTL_ADD, raw, (id << 2) | kConn, kConnEvents)) {
+        RPC_LOGE("cannot poll a connection to %s: %s", l->name.c_str(), strerror(errno));
+        mConns.erase(id);
+      }
+    }
+  }
+
+  // Reads what is there (readLock held); false when the connection is to
+  // be closed. Calls go to *fresh, answers to their waiting calls. Once the
+  // peer has stopped sending (`toEnd`), reads up to the end at once, so its
+  // end is seen in the same turn as its last bytes.
+  bool readConn(const std::shared_ptr<ServerConn>& c, std::vector<Task>* fresh, bool toEnd) {
+    for (int round = 0; round < kReadRoundsToEnd; ++round) {
+      if (!readChunk(c, fresh)) return false;
+      if (!toEnd) break;
+    }
+    return true;
+  }
+
+  // One recv's worth; false when the connection is to be closed.
+  bool readChunk(const std::shared_ptr<ServerConn>& c, std::vector<Task>* fresh) {
+    uint8_t buf[kReadChunk];
+    ssize_t n = recv(c->fd(), buf, sizeof(buf), MSG_DONTWAIT);
     if (n < 0) return errno == EAGAIN || errno == EWOULDBLOCK || errno == EINTR;
     if (n == 0) {
-      if (c->decoder().pending() > 0) {
-        RPC_LOGE("connection to %s from pid %d ended inside a frame", c->name().c_str(),
-                 c->pid());
+      if (c->decoder.pending() > 0) {
+        RPC_LOGE("connection to %s from pid %d ended inside a frame", c->name().c_str(), c->pid());
       }
       return false;
     }
-    if (!c->decoder().feed(buf.data(), static_cast<size_t>(n))) {
+    if (!c->decoder.feed(buf, static_cast<size_t>(n))) {
       RPC_LOGE("closing connection to %s from pid %d: malformed frame: %s", c->name().c_str(),
-               c->pid(), c->decoder().error().c_str());
+               c->pid(), c->decoder.error().c_str());
       return false;
     }
     Frame f;
-    while (c->decoder().next(&f)) {
+    while (c->decoder.next(&f)) {
       if (f.kind == FrameKind::Call) {
-        c->inflight.fetch_add(1);
-        queue([this, c, f = std::move(f)] {
-          c->serveCall(f);
-          if (c->inflight.fetch_sub(1) >= kMaxInflightPerConnection) wake();
-        });
+        fresh->push_back(Task{c, std::move(f), {}});
         f = Frame();
       } else if (!c->deliverAnswer(std::move(f))) {
         RPC_LOGE("closing connection to %s from pid %d: answer to no call", c->name().c_str(),
@@ -632,94 +913,42 @@ class Host {
     return true;
   }
 
-  void closeConn(const std::shared_ptr<ServerConn>& c) {
-    for (auto& link : c->markClosed()) {
-      queue([link] {
-        if (link.recipient != nullptr) link.recipient->serviceDied(link.cookie, link.who);
-      });
-    }
-  }
-
-  void ioLoop() {
-    std::vector<std::shared_ptr<ServerConn>> conns;
-    std::vector<uint8_t> buf(kReadChunk);
-    int wakeFd;
+  // Ends `c` (readLock held): out of the set, its socket closed, its death
+  // notices into *fresh.
+  void closeConnLocked(const std::shared_ptr<ServerConn>& c, std::vector<Task>* fresh) {
+    c->readClosed = true;
     {
       std::lock_guard<std::mutex> g(mLock);
-      wakeFd = mWakeRead.get();
+      mConns.erase(c->id());
+      if (mEpoll.get() >= 0) epoll_ctl(mEpoll.get(), EPOLL_CTL_DEL, c->fd(), nullptr);
     }
-    // Kept across turns: one turn per incoming call, and their storage need
-    // not be allocated anew each time.
-    std::vector<Listener*> listeners;
-    std::vector<pollfd> pfds;
-    std::vector<std::shared_ptr<ServerConn>> keep;
-    for (;;) {
-      listeners.clear();
-      {
-        std::lock_guard<std::mutex> g(mLock);
-        if (mStopping) break;
-        for (auto& l : mListeners) listeners.push_back(l.get());
-      }
-      pfds.clear();
-      pfds.push_back({wakeFd, POLLIN, 0});
-      for (auto* l : listeners) pfds.push_back({l->fd.get(), POLLIN, 0});
-      for (auto& c : conns) {
-        short ev = c->inflight.load() < kMaxInflightPerConnection ? POLLIN : 0;
-        pfds.push_back({c->fd(), ev, 0});
-      }
-      int r = poll(pfds.data(), pfds.size(), -1);
-      if (r < 0) {
-        if (errno != EINTR) RPC_LOGE("poll failed: %s", strerror(errno));
-        continue;
-      }
-      if (pfds[0].revents) {
-        char drain[64];
-        while (read(wakeFd, drain, sizeof(drain)) > 0) {
-        }
-      }
-      size_t base = 1 + listeners.size();
-      keep.reserve(conns.size());
-      for (size_t i = 0; i < conns.size(); ++i) {
-        short rev = pfds[base + i].revents;
-        bool alive = true;
-        if (rev & POLLIN) {
-          alive = readConn(conns[i], buf);
-        } else if (rev & (POLLHUP | POLLERR | POLLNVAL)) {
-          alive = false;
-        }
-        if (alive) {
-          keep.push_back(std::move(conns[i]));
-        } else {
-          closeConn(conns[i]);
-        }
-      }
-      conns.swap(keep);
-      keep.clear();  // closed connections go now, not at the next turn
-      for (size_t i = 0; i < listeners.size(); ++i) {
-        if (pfds[1 + i].revents & POLLIN) acceptOne(listeners[i], conns);
-      }
-    }
-    // Stopping: no death notices, just wake whoever waits on these clients.
-    for (auto& c : conns) c->markClosed();
+    for (auto& link : c->markClosed()) fresh->push_back(Task{nullptr, Frame(), std::move(link)});
   }
 
   std::mutex mLock;
-  std::condition_variable mTaskCv;
-  std::condition_variable mJoinCv;
-  std::deque<std::function<void()>> mTasks;
+  std::condition_variable mJoinCv;  // joiners leaving, readers done at shutdown
+  std::deque<Task> mTasks;
   size_t mMaxThreads = 1;
   bool mCallerJoins = false;
   size_t mSpawned = 0;
   size_t mBusy = 0;
+  size_t mWaiting = 0;   // pool threads in epoll_wait
+  size_t mHandling = 0;  // threads reading a socket without the lock
   int mActiveJoiners = 0;
   bool mRunning = false;
   bool mStopping = false;
   std::vector<std::thread> mWorkers;
-  std::thread mIo;
   std::vector<std::unique_ptr<Listener>> mListeners;
-  UniqueFd mWakeRead;
-  std::atomic<int> mWakeWrite{-1};
+  std::map<uint64_t, std::shared_ptr<ServerConn>> mConns;
+  uint64_t mNextConnId = 0;
+  UniqueFd mEpoll;
+  UniqueFd mStopFd;
+  UniqueFd mWorkFd;
 };
+
+void readWhileWaiting(const std::shared_ptr<ServerConn>& conn, int wakeFd) {
+  Host::get().readWhileWaiting(conn, wakeFd);
+}
 
 // ---------------------------------------------------------------------------
 // Client side: one thread at a time drives the connection; the thread that

@@ -11,7 +11,10 @@
 #include <sys/un.h>
 
 #include <cstring>
+#include <filesystem>
 #include <fstream>
+#include <future>
+#include <set>
 
 #include "rpc_test_util.h"
 
@@ -196,6 +199,180 @@ TEST_F(RpcHostTest, PoolOfTwoRunsTwoCallsAtOnceAndTheThirdWaits) {
   for (auto& t : callers) t.join();
   EXPECT_EQ(ok, 3);
   EXPECT_EQ(se->maxRunning(), 2);
+}
+
+// The pool has no reader of its own: a client's answer to a callback must
+// still be read while every pool thread is in a call.
+TEST_F(RpcHostTest, CallbackAnswersAreReadWhileEveryPoolThreadIsBusy) {
+  struct Case {
+    const char* name;
+    size_t threads;
+    bool fromPoolThread;  // init calls back on the last free pool thread
+  };
+  const Case cases[] = {
+      {"one thread, callback from another thread", 1, false},
+      {"two threads, callback from another thread", 2, false},
+      {"two threads, callback from init on the second", 2, true},
+  };
+  for (const Case& c : cases) {
+    SCOPED_TRACE(c.name);
+    se = new FakeSecureElement();
+    se->blockTransmit = true;
+    se->deferStateChange = !c.fromPoolThread;
+    startServer(c.threads);
+    sp<ISecureElement> client = ISecureElement::getService("SIM1");
+    ASSERT_NE(client, nullptr);
+    // A server that never reads the answer fails the test instead of hanging it.
+    ASSERT_TRUE(::android::host::setCallTimeout(client, 10000));
+    sp<ClientCallback> cb = new ClientCallback();
+    if (!c.fromPoolThread) {
+      ASSERT_TRUE(client->init(cb).isOk());
+    }
+
+    // Blocked calls hold the pool threads (all of them, or all but one).
+    const size_t blocked = c.fromPoolThread ? c.threads - 1 : c.threads;
+    std::atomic<int> ok{0};
+    std::vector<std::thread> blockers;
+    for (size_t i = 0; i < blocked; ++i) {
+      blockers.emplace_back([&] {
+        sp<ISecureElement> other = ISecureElement::getService("SIM1");
+        if (other != nullptr && other->transmit({0x01}, [](const hidl_vec<uint8_t>&) {}).isOk()) {
+          ++ok;
+        }
+      });
+    }
+    ASSERT_TRUE(se->waitEntered(static_cast<int>(blocked)));
+
+    std::thread later;
+    std::promise<bool> serviceCall;  // outlives `later`
+    std::future<bool> serviceCallOk = serviceCall.get_future();
+    if (c.fromPoolThread) {
+      // init runs on the one free thread and waits there for the answer.
+      EXPECT_TRUE(client->init(cb).isOk());
+    } else {
+      later = std::thread(
+          [&] { serviceCall.set_value(se->callback()->onStateChange(true).isOk()); });
+      EXPECT_EQ(::android::host::pollIncomingCalls(client, 10000), 1);
+      // The answer is read though every pool thread is blocked.
+      if (serviceCallOk.wait_for(std::chrono::seconds(10)) == std::future_status::ready) {
+        EXPECT_TRUE(serviceCallOk.get());
+      } else {
+        ADD_FAILURE() << "the answer was not read while the pool was busy";
+      }
+    }
+    EXPECT_EQ(cb->states, std::vector<bool>{true});
+
+    se->release(static_cast<int>(blocked));
+    for (auto& t : blockers) t.join();
+    if (later.joinable()) later.join();
+    EXPECT_EQ(ok, static_cast<int>(blocked));
+    // Still served afterwards.
+    EXPECT_TRUE(client->isCardPresent().isOk());
+    client = nullptr;
+    server->stop();
+    server.reset();
+  }
+}
+
+// Calls that arrive in one read are not run one after the other by the
+// thread that read them: each gets a pool thread.
+TEST_F(RpcHostTest, CallsReadTogetherRunAtOnce) {
+  se->blockTransmit = true;
+  startServer(2);
+  int fd = connectRaw("SIM1");
+  ASSERT_GE(fd, 0);
+  std::vector<uint8_t> both;
+  for (uint8_t id : {1, 2}) {
+    // transmit of one byte: its length (u32) and the byte
+    std::vector<uint8_t> f = frameBytes(FrameKind::Call, id, 0, 4, {1, 0, 0, 0, id});
+    both.insert(both.end(), f.begin(), f.end());
+  }
+  ASSERT_EQ(send(fd, both.data(), both.size(), MSG_NOSIGNAL), static_cast<ssize_t>(both.size()));
+  EXPECT_TRUE(se->waitEntered(2));
+  EXPECT_EQ(se->maxRunning(), 2);
+  se->release(2);
+
+  ::android::host::rpc::FrameDecoder decoder;
+  std::set<uint32_t> answered;
+  ::android::host::rpc::Frame f;
+  while (answered.size() < 2) {
+    pollfd pfd{fd, POLLIN, 0};
+    ASSERT_EQ(poll(&pfd, 1, 10000), 1);
+    uint8_t buf[256];
+    ssize_t n = recv(fd, buf, sizeof(buf), 0);
+    ASSERT_GT(n, 0);
+    ASSERT_TRUE(decoder.feed(buf, static_cast<size_t>(n)));
+    while (decoder.next(&f)) {
+      EXPECT_EQ(f.kind, FrameKind::Reply);
+      answered.insert(f.id);
+    }
+  }
+  EXPECT_EQ(answered, (std::set<uint32_t>{1, 2}));
+  close(fd);
+}
+
+// More calls than a connection may have queued: reading it pauses at the
+// limit and goes on as they finish, so every call is answered.
+TEST_F(RpcHostTest, CallsBeyondTheConnectionsLimitAreAllAnswered) {
+  se->blockTransmit = true;
+  startServer(2);
+  int fd = connectRaw("SIM1");
+  ASSERT_GE(fd, 0);
+  auto sendCalls = [&](uint32_t first, uint32_t count) {
+    std::vector<uint8_t> all;
+    for (uint32_t id = first; id < first + count; ++id) {
+      std::vector<uint8_t> f =
+          frameBytes(FrameKind::Call, id, 0, 4, {1, 0, 0, 0, static_cast<uint8_t>(id)});
+      all.insert(all.end(), f.begin(), f.end());
+    }
+    return send(fd, all.data(), all.size(), MSG_NOSIGNAL) == static_cast<ssize_t>(all.size());
+  };
+  // Two running, the rest queued: the connection is at its limit.
+  ASSERT_TRUE(sendCalls(1, 8));
+  ASSERT_TRUE(se->waitEntered(2));
+  // These can only be read once some of the first have finished.
+  ASSERT_TRUE(sendCalls(9, 12));
+  constexpr uint32_t kCalls = 20;
+  se->release(kCalls);
+
+  ::android::host::rpc::FrameDecoder decoder;
+  std::set<uint32_t> answered;
+  ::android::host::rpc::Frame f;
+  while (answered.size() < kCalls) {
+    pollfd pfd{fd, POLLIN, 0};
+    ASSERT_EQ(poll(&pfd, 1, 10000), 1) << answered.size() << " of " << kCalls << " answered";
+    uint8_t buf[4096];
+    ssize_t n = recv(fd, buf, sizeof(buf), 0);
+    ASSERT_GT(n, 0);
+    ASSERT_TRUE(decoder.feed(buf, static_cast<size_t>(n)));
+    while (decoder.next(&f)) {
+      ASSERT_EQ(f.kind, FrameKind::Reply);
+      // transmit's answer: the byte sent and 90 00
+      EXPECT_EQ(f.body, (std::vector<uint8_t>{3, 0, 0, 0, static_cast<uint8_t>(f.id), 0x90, 0x00}));
+      answered.insert(f.id);
+    }
+  }
+  EXPECT_EQ(se->maxRunning(), 2);
+  close(fd);
+}
+
+// The pool's threads are all the host starts: a pool of three is the
+// joining thread and two more, with no thread of its own for reading.
+TEST_F(RpcHostTest, PoolOfThreeStartsTwoThreads) {
+  auto threads = [] {
+    size_t n = 0;
+    for (const auto& e : std::filesystem::directory_iterator("/proc/self/task")) {
+      (void)e;
+      ++n;
+    }
+    return n;
+  };
+  const size_t before = threads();
+  startServer(3);  // the helper joins on a thread of its own
+  sp<ISecureElement> client = ISecureElement::getService("SIM1");
+  ASSERT_NE(client, nullptr);
+  ASSERT_TRUE(client->isCardPresent().isOk());  // the joiner has joined
+  EXPECT_EQ(threads(), before + 3);
 }
 
 TEST_F(RpcHostTest, ClosedConnectionNotifiesLinkedAndNotUnlinkedRecipients) {
