@@ -1,6 +1,7 @@
 #pragma once
-// Between the generic transport (rpc_host.cpp: sockets, frames, the pool) and
-// the interface marshalling (secure_element_rpc.cpp: stubs and proxies).
+// Between the generic transport (rpc_host.cpp and the rpc_* units beside it:
+// sockets, frames, the pool) and the interface marshalling
+// (secure_element_rpc.cpp: stubs and proxies).
 #include <cstdint>
 #include <functional>
 #include <memory>
