@@ -19,7 +19,7 @@ namespace rpc {
 
 class ServerConn;
 // A thread in a call to a client waits for the answer by reading the
-// client's connection itself (defined with the pool below): the pool's
+// client's connection itself (defined with the pool, rpc_pool.cpp): the pool's
 // threads may all be busy.
 void readWhileWaiting(const std::shared_ptr<ServerConn>& conn, int wakeFd);
 
