@@ -284,6 +284,36 @@ size_t countOf(const std::string& text, const std::string& needle) {
   return n;
 }
 
+System::~System() {
+  if (daemon) {
+    daemon->stop(SIGKILL);
+    expectNoSanitizerReport("daemon", daemon->err().text());
+  }
+  if (!::testing::Test::HasFailure()) return;
+  if (daemon) fprintf(stderr, "---- daemon ----\n%s", daemon->err().text().c_str());
+  if (modem) fprintf(stderr, "---- modem ----\n%s", modem->err().text().c_str());
+}
+
+int openEcho(SecliSession& s) {
+  const std::string open = s.call(std::string("open ") + kEchoApplet);
+  EXPECT_EQ(field(open, "status"), "SUCCESS") << open;
+  return field(open, "status") == "SUCCESS" ? atoi(field(open, "channel").c_str()) : -1;
+}
+
+std::string echoCommand(int channel, const std::string& byte) {
+  return "transmit " + hexByte(channel) + " 01 00 00 01 " + byte;
+}
+
+std::string echo(SecliSession& s, int channel, const std::string& byte) {
+  return field(s.call(echoCommand(channel, byte)), "response");
+}
+
+long msSince(std::chrono::steady_clock::time_point t0) {
+  return static_cast<long>(std::chrono::duration_cast<std::chrono::milliseconds>(
+                               std::chrono::steady_clock::now() - t0)
+                               .count());
+}
+
 void expectNoSanitizerReport(const std::string& who, const std::string& text) {
   for (const char* mark : {"ERROR: AddressSanitizer", "ERROR: LeakSanitizer",
                            "WARNING: ThreadSanitizer", "runtime error:"}) {
