@@ -127,7 +127,7 @@ class AidlEndToEnd : public ::testing::Test, public System {
   }
 };
 
-TEST_F(AidlEndToEnd, InitWithoutACallbackFailsAndEveryInitReportsReady) {
+TEST_F(AidlEndToEnd, InitNeedsACallbackReportsReadyEachTimeAndSaysWhenItCannot) {
   ASSERT_NO_FATAL_FAILURE(start());
   for (const std::string instance : kInstances) {
     SCOPED_TRACE(instance);
@@ -142,6 +142,19 @@ TEST_F(AidlEndToEnd, InitWithoutACallbackFailsAndEveryInitReportsReady) {
     EXPECT_TRUE(c.se->getInterfaceVersion(&version).isOk());
     EXPECT_EQ(version, 1);
   }
+  // A reset that cannot bring the element back fails.
+  EXPECT_EQ(nameOf(Client("eSE1").se->reset()), "FAILED");  // no init: nothing to report to
+  Client c("eSE1");
+  ASSERT_EQ(c.init(), "SUCCESS");
+  root.property("vendor.ese_sim.fail_open=1");
+  EXPECT_EQ(nameOf(c.se->reset()), "FAILED");
+  EXPECT_EQ(c.cb->seen(), (std::vector<bool>{true, false}));
+  // An init that cannot open the element says so instead of leaving the
+  // client waiting for a state.
+  EXPECT_EQ(c.init(), "IOERROR");
+  root.property("vendor.ese_sim.fail_open=0");
+  EXPECT_EQ(nameOf(c.se->reset()), "SUCCESS");
+  EXPECT_EQ(c.cb->seen(), (std::vector<bool>{true, false, false, true}));
 }
 
 // Logical channels 1..19 with a select response, failures with the HIDL
@@ -249,22 +262,6 @@ TEST_F(AidlEndToEnd, ResetClosesEveryChannelAndReportsFalseThenTrue) {
     ASSERT_EQ(c.open(kEchoAid, &again), "SUCCESS");
     EXPECT_EQ(c.transmit(again.channelNumber, 0x32), "SUCCESS");
   }
-}
-
-TEST_F(AidlEndToEnd, AResetThatCannotBringTheElementBackFails) {
-  ASSERT_NO_FATAL_FAILURE(start());
-  EXPECT_EQ(nameOf(Client("eSE1").se->reset()), "FAILED");  // no init: nothing to report to
-  Client c("eSE1");
-  ASSERT_EQ(c.init(), "SUCCESS");
-  root.property("vendor.ese_sim.fail_open=1");
-  EXPECT_EQ(nameOf(c.se->reset()), "FAILED");
-  EXPECT_EQ(c.cb->seen(), (std::vector<bool>{true, false}));
-  // An init that cannot open the element says so instead of leaving the
-  // client waiting for a state.
-  EXPECT_EQ(c.init(), "IOERROR");
-  root.property("vendor.ese_sim.fail_open=0");
-  EXPECT_EQ(nameOf(c.se->reset()), "SUCCESS");
-  EXPECT_EQ(c.cb->seen(), (std::vector<bool>{true, false, false, true}));
 }
 
 TEST_F(AidlEndToEnd, AFailedExchangeIsAnErrorNotAnEmptySuccess) {
