@@ -73,13 +73,11 @@ class ScriptedHidl : public HidlSE {
 
 class States : public BnSecureElementCallback {
  public:
-  ScopedAStatus onStateChange(bool connected, const std::string& reason) override {
+  ScopedAStatus onStateChange(bool connected, const std::string&) override {
     seen.push_back(connected);
-    reasons.push_back(reason);
     return ScopedAStatus::ok();
   }
   std::vector<bool> seen;
-  std::vector<std::string> reasons;
 };
 
 std::string nameOf(const ScopedAStatus& st) {
@@ -212,17 +210,6 @@ TEST_F(AidlFrontTest, TheBasicChannelIsOpenFromASuccessfulOpenUntilItsClose) {
   EXPECT_EQ(nameOf(front->closeChannel(0)), "SUCCESS");
   EXPECT_EQ(nameOf(front->closeChannel(0)), "FAILED");
   EXPECT_EQ(hidl->calls, (std::vector<std::string>{"basic", "basic", "basic", "transmit", "close 0"}));
-}
-
-TEST_F(AidlFrontTest, InitNeedsACallbackAndSaysWhenTheElementDidNotComeUp) {
-  EXPECT_FALSE(front->init(nullptr).isOk());
-  EXPECT_EQ(nameOf(front->init(states)), "SUCCESS");
-  EXPECT_EQ(nameOf(front->init(states)), "SUCCESS");
-  hidl->comesUp = false;
-  EXPECT_EQ(nameOf(front->init(states)), "IOERROR");
-  EXPECT_EQ(states->seen, (std::vector<bool>{true, true}));
-  EXPECT_EQ(states->reasons[0], "eSE1 is ready");
-  EXPECT_EQ(hidl->calls, (std::vector<std::string>{"init null", "init", "init", "init"}));
 }
 
 TEST_F(AidlFrontTest, ResetClosesEveryChannelThenReportsFalseAndTrue) {
