@@ -11,7 +11,6 @@
 
 #include <algorithm>
 #include <chrono>
-#include <cstdlib>
 #include <fstream>
 #include <memory>
 #include <sstream>
@@ -25,77 +24,38 @@ namespace {
 using namespace se_test;
 using Clock = std::chrono::steady_clock;
 
-constexpr const char* kEchoAid = "A00000000101";
 // A basic-channel APDU: it goes to the modem as AT+CSIM.
 constexpr const char* kBasicGetData = "transmit 00 CA 00 66 00";
 
-long msSince(Clock::time_point t0) {
-  return static_cast<long>(
-      std::chrono::duration_cast<std::chrono::milliseconds>(Clock::now() - t0).count());
+// Asks "present" until the answer is true; false when it never is within
+// `ms`. Right after the port's log line a call may still find it away.
+bool servedWithin(SecliSession& s, long ms) {
+  const auto t0 = Clock::now();
+  do {
+    if (field(s.call("present"), "present") == "true") return true;
+  } while (msSince(t0) < ms);
+  return false;
 }
 
-class FaultsBase {
- protected:
-  void tearDown(bool failed) {
-    if (daemon) {
-      daemon->stop(SIGKILL);
-      expectNoSanitizerReport("daemon", daemon->err().text());
-      if (failed) fprintf(stderr, "---- daemon ----\n%s", daemon->err().text().c_str());
-    }
-    if (modem && failed) fprintf(stderr, "---- modem ----\n%s", modem->err().text().c_str());
-  }
-  // The channel of a successful open of the echo applet, or -1.
-  static int openEcho(SecliSession& s) {
-    const std::string open = s.call(std::string("open ") + kEchoAid);
-    EXPECT_EQ(field(open, "status"), "SUCCESS") << open;
-    return field(open, "status") == "SUCCESS" ? std::atoi(field(open, "channel").c_str()) : -1;
-  }
-  static std::string echoCommand(int channel, const std::string& byte) {
-    return "transmit " + hexByte(channel) + " 01 00 00 01 " + byte;
-  }
-  static std::string echo(SecliSession& s, int channel, const std::string& byte) {
-    return field(s.call(echoCommand(channel, byte)), "response");
-  }
-  // Asks "present" until the answer is true; false when it never is within
-  // `ms`. The port's log line comes just before the worker takes requests,
-  // so the first call may still find it away; each call fails at once then.
-  static bool servedWithin(SecliSession& s, long ms) {
-    const auto t0 = Clock::now();
-    do {
-      if (field(s.call("present"), "present") == "true") return true;
-    } while (msSince(t0) < ms);
-    return false;
-  }
-  // SIM1's init reports its state after a short pause for the worker to
-  // start, and a loaded machine may start it later: the port can still be
-  // unopened when init returns, and a call made then fails. Tests that need
-  // the port wait until a call is served.
-  static bool initSim(SecliSession& s) {
-    return field(s.call("init"), "state") == "true" && servedWithin(s, 10000);
-  }
-  // The answer to a command sent earlier with send().
-  static std::string answerOf(SecliSession& s) {
-    std::string line;
-    if (!s.answer(&line)) return "(no answer; stderr: " + s.process().err().text() + ")";
-    return line;
-  }
+// SIM1's init returns once the worker has had its first try at the port; a
+// loaded machine may need more: wait until a call is served.
+bool initSim(SecliSession& s) {
+  return field(s.call("init"), "state") == "true" && servedWithin(s, 10000);
+}
 
-  TempRoot root;
-  std::unique_ptr<Process> modem;
-  std::unique_ptr<Process> daemon;
-};
+// The answer to a command sent earlier with send().
+std::string answerOf(SecliSession& s) {
+  std::string line;
+  return s.answer(&line) ? line : "(no answer; stderr: " + s.process().err().text() + ")";
+}
 
 enum class OpenForm { kPrefixed, kBare };
 
-class SimFaults : public FaultsBase, public ::testing::TestWithParam<OpenForm> {
+class SimFaults : public ::testing::TestWithParam<OpenForm>, public System {
  protected:
-  void TearDown() override { tearDown(HasFailure()); }
-  std::vector<std::string> modemArgs(std::vector<std::string> extra = {}) const {
-    if (GetParam() == OpenForm::kBare) extra.push_back("--bare-open");
-    return extra;
-  }
   void startModem(std::vector<std::string> extra = {}) {
-    modem = se_test::startModem(root, 0, modemArgs(std::move(extra)));
+    if (GetParam() == OpenForm::kBare) extra.push_back("--bare-open");
+    modem = se_test::startModem(root, 0, extra);
   }
 };
 
@@ -110,16 +70,12 @@ TEST_P(SimFaults, ASilentModemLeavesEse1Answering) {
   const int ch = openEcho(sim);  // opens still work: only AT+CSIM is silent
   ASSERT_GE(ch, 1);
   SecliSession ese(root, "eSE1");
-  ASSERT_EQ(field(ese.call("init"), "state"), "true");
   auto victim = std::make_unique<SecliSession>(root, "eSE1");
-  ASSERT_EQ(field(victim->call("init"), "state"), "true");
-
-  // The two callers that will queue behind the stuck one, connected already,
-  // so that their calls reach the daemon before eSE1's.
+  for (SecliSession* s : {&ese, victim.get()}) ASSERT_EQ(field(s->call("init"), "state"), "true");
+  // Connected already, so that their calls reach the daemon before eSE1's.
   SecliSession sim2(root, "SIM1");
   SecliSession sim3(root, "SIM1");
-  ASSERT_EQ(field(sim2.call("present"), "present"), "true");
-  ASSERT_EQ(field(sim3.call("present"), "present"), "true");
+  for (SecliSession* s : {&sim2, &sim3}) ASSERT_EQ(field(s->call("present"), "present"), "true");
 
   size_t mark = modem->err().size();
   sim.send(kBasicGetData);
@@ -128,7 +84,7 @@ TEST_P(SimFaults, ASilentModemLeavesEse1Answering) {
   sim3.send(echoCommand(ch, "AA"));
 
   auto t0 = Clock::now();
-  EXPECT_EQ(field(ese.call("transmit 00 CA 00 66 00"), "response").substr(0, 2), "66");
+  EXPECT_EQ(field(ese.call(kBasicGetData), "response").substr(0, 2), "66");
   EXPECT_LT(msSince(t0), 1000);
   RecordProperty("ese_transmit_ms", static_cast<int>(msSince(t0)));
 
@@ -141,7 +97,6 @@ TEST_P(SimFaults, ASilentModemLeavesEse1Answering) {
   RecordProperty("ese_death_notice_ms", static_cast<int>(msSince(t0)));
   victim.reset();
 
-  // The two waiting SIM callers gave up with their usual failures.
   EXPECT_EQ(field(answerOf(sim2), "present"), "false");
   EXPECT_EQ(field(answerOf(sim3), "response"), "");
   EXPECT_TRUE(daemon->err().waitFor("SIM busy: call given up"));
@@ -156,12 +111,131 @@ TEST_P(SimFaults, ASilentModemLeavesEse1Answering) {
   EXPECT_LT(msSince(t0), 1000);
 }
 
+// The modem restarts: while its port is away SIM1 calls fail within 6 s
+// each; once it is back SIM1 serves again within 10 s, without a daemon
+// restart. Channels from before are gone with the modem.
+TEST_P(SimFaults, Sim1ServesAgainAfterTheModemRestarts) {
+  ASSERT_NO_FATAL_FAILURE(startModem());
+  daemon = startDaemon(root);
+  SecliSession sim(root, "SIM1");
+  ASSERT_TRUE(initSim(sim));
+  const int old = openEcho(sim);
+  ASSERT_GE(old, 1);
+  ASSERT_EQ(echo(sim, old, "11"), "119000");
+
+  size_t mark = daemon->err().size();
+  modem->stop(SIGTERM);
+  ASSERT_TRUE(daemon->err().waitFor("AT port lost", mark));
+  const std::vector<std::string> whileAway[] = {
+      {"present", "present", "false"},
+      {"atr", "atr", ""},
+      {echoCommand(old, "22"), "response", ""},
+      {std::string("open ") + kEchoApplet, "status", "FAILED"},
+      {"close " + std::to_string(old), "status", "FAILED"},
+  };
+  long slowest = 0;
+  for (const auto& c : whileAway) {
+    const auto t0 = Clock::now();
+    EXPECT_EQ(field(sim.call(c[0]), c[1]), c[2]) << c[0];
+    EXPECT_LT(msSince(t0), 6000) << c[0];
+    slowest = std::max(slowest, msSince(t0));
+  }
+  RecordProperty("slowest_call_while_away_ms", static_cast<int>(slowest));
+
+  mark = daemon->err().size();
+  const auto back = Clock::now();
+  ASSERT_NO_FATAL_FAILURE(startModem());
+  ASSERT_TRUE(daemon->err().waitFor("AT port back", mark));
+  EXPECT_TRUE(servedWithin(sim, 10000 - msSince(back)));
+  RecordProperty("served_after_restart_ms", static_cast<int>(msSince(back)));
+  EXPECT_EQ(echo(sim, old, "33"), "");  // the old session went with the modem
+  EXPECT_EQ(echo(sim, openEcho(sim), "44"), "449000");
+}
+
+// The modem's port appears only after SIM1's first init has given up its
+// start attempts: calls fail until then, and SIM1 serves once it is there.
+TEST_P(SimFaults, AModemThatComesUpLateIsServed) {
+  daemon = startDaemon(root);
+  SecliSession sim(root, "SIM1");
+  const size_t mark = daemon->err().size();
+  sim.send("init");
+  ASSERT_TRUE(daemon->err().waitFor("still waiting for the AT port", mark));
+  EXPECT_EQ(field(answerOf(sim), "state"), "true");
+  const auto t0 = Clock::now();
+  EXPECT_EQ(field(sim.call("present"), "present"), "false");
+  EXPECT_LT(msSince(t0), 6000);
+
+  const auto up = Clock::now();
+  ASSERT_NO_FATAL_FAILURE(startModem());
+  ASSERT_TRUE(daemon->err().waitFor("AT port back", mark));
+  EXPECT_TRUE(servedWithin(sim, 10000));
+  RecordProperty("served_after_start_ms", static_cast<int>(msSince(up)));
+  EXPECT_EQ(echo(sim, openEcho(sim), "55"), "559000");
+}
+
+// A +CGLA:/+CSIM: answer whose length field is shorter than its text is a
+// failure, never a response cut before its status word; the failed open
+// releases the session the modem gave.
+TEST_P(SimFaults, AShortLengthFieldGivesAFailure) {
+  ASSERT_NO_FATAL_FAILURE(startModem({"--short-length"}));
+  daemon = startDaemon(root);
+  SecliSession sim(root, "SIM1");
+  ASSERT_TRUE(initSim(sim));
+  EXPECT_EQ(field(sim.call(kBasicGetData), "response"), "");
+  const std::string open = sim.call(std::string("open ") + kEchoApplet);
+  EXPECT_EQ(field(open, "status"), "FAILED") << open;
+  EXPECT_TRUE(modem->err().waitFor("< AT+CCHC=257"));
+}
+
+// A healthy but slow modem (150 ms per answer) and three SIM1 clients at
+// once: nobody gives up, every answer is right.
+TEST_P(SimFaults, ASlowModemServesEveryWaitingClient) {
+  ASSERT_NO_FATAL_FAILURE(startModem({"--delay", "150"}));
+  daemon = startDaemon(root);
+  std::vector<std::unique_ptr<SecliSession>> clients;
+  for (int i = 0; i < 3; ++i) {
+    clients.push_back(std::make_unique<SecliSession>(root, "SIM1"));
+    ASSERT_TRUE(initSim(*clients.back()));
+  }
+  for (auto& c : clients) c->send(std::string("open ") + kEchoApplet);
+  std::vector<int> channels;
+  for (auto& c : clients) {
+    const std::string open = answerOf(*c);
+    EXPECT_EQ(field(open, "status"), "SUCCESS") << open;
+    channels.push_back(std::atoi(field(open, "channel").c_str()));
+  }
+  for (size_t i = 0; i < clients.size(); ++i) clients[i]->send(echoCommand(channels[i], hexByte(i)));
+  for (size_t i = 0; i < clients.size(); ++i) {
+    EXPECT_EQ(field(answerOf(*clients[i]), "response"), hexByte(i) + "9000");
+  }
+  EXPECT_EQ(daemon->err().text().find("given up"), std::string::npos);
+}
+
+INSTANTIATE_TEST_SUITE_P(OpenForms, SimFaults,
+                         ::testing::Values(OpenForm::kPrefixed, OpenForm::kBare),
+                         [](const ::testing::TestParamInfo<OpenForm>& info) {
+                           return info.param == OpenForm::kBare ? "Bare" : "Prefixed";
+                         });
+
+class EseFaults : public ::testing::Test, public System {
+ protected:
+  void start() {
+    modem = se_test::startModem(root, 0);
+    daemon = startDaemon(root);
+  }
+  std::string openChannelsOnTheCard() {
+    std::ifstream in(root.at("data/vendor/ese_sim/open_channels"));
+    std::stringstream ss;
+    ss << in.rdbuf();
+    return in ? ss.str() : "(no report)";
+  }
+};
+
 // A vendor library call that hangs: SIM1 is served within a second, other
 // eSE callers give up with their usual failure, a death notice is not held
 // up, and once the call returns the eSE serves again.
-TEST_P(SimFaults, AHungVendorCallLeavesSim1Answering) {
-  ASSERT_NO_FATAL_FAILURE(startModem());
-  daemon = startDaemon(root);
+TEST_F(EseFaults, AHungVendorCallLeavesSim1Answering) {
+  ASSERT_NO_FATAL_FAILURE(start());
   SecliSession sim(root, "SIM1");
   ASSERT_TRUE(initSim(sim));
   const int simCh = openEcho(sim);
@@ -187,12 +261,9 @@ TEST_P(SimFaults, AHungVendorCallLeavesSim1Answering) {
   RecordProperty("sim_transmit_ms", static_cast<int>(msSince(t0)));
   EXPECT_EQ(field(answerOf(other), "response"), "1F");
   EXPECT_TRUE(daemon->err().waitFor("transmit: the eSE library has not returned for", mark));
-
-  // A later caller gives up at once; SIM1 goes on serving.
-  t0 = Clock::now();
-  EXPECT_EQ(field(other.call("open A00000000101"), "status"), "FAILED");
+  t0 = Clock::now();  // a later caller gives up at once
+  EXPECT_EQ(field(other.call(std::string("open ") + kEchoApplet), "status"), "FAILED");
   EXPECT_LT(msSince(t0), 1000);
-  EXPECT_EQ(field(sim.call("present"), "present"), "true");
 
   mark = daemon->err().size();
   t0 = Clock::now();
@@ -210,138 +281,8 @@ TEST_P(SimFaults, AHungVendorCallLeavesSim1Answering) {
   EXPECT_TRUE(daemon->err().waitFor("serviceDied: the deferred library call runs now", mark));
   EXPECT_TRUE(daemon->err().waitFor("phQvEse_close: closed", mark));
   ASSERT_EQ(field(other.call("init"), "state"), "true");
-  const int again = openEcho(other);
-  EXPECT_EQ(echo(other, again, "77"), "779000");
+  EXPECT_EQ(echo(other, openEcho(other), "77"), "779000");
 }
-
-// The modem restarts: while its port is away SIM1 calls fail within 6 s
-// each; once it is back SIM1 serves again within 10 s, without a daemon
-// restart. Channels from before are gone with the modem.
-TEST_P(SimFaults, Sim1ServesAgainAfterTheModemRestarts) {
-  ASSERT_NO_FATAL_FAILURE(startModem());
-  daemon = startDaemon(root);
-  SecliSession sim(root, "SIM1");
-  ASSERT_TRUE(initSim(sim));
-  const int old = openEcho(sim);
-  ASSERT_GE(old, 1);
-  ASSERT_EQ(echo(sim, old, "11"), "119000");
-
-  size_t mark = daemon->err().size();
-  modem->stop(SIGTERM);
-  ASSERT_TRUE(daemon->err().waitFor("AT port lost", mark));
-  struct Case {
-    std::string command, name, want;
-  };
-  const Case whileAway[] = {
-      {"present", "present", "false"},
-      {"atr", "atr", ""},
-      {echoCommand(old, "22"), "response", ""},
-      {std::string("open ") + kEchoAid, "status", "FAILED"},
-      {"close " + std::to_string(old), "status", "FAILED"},
-  };
-  long slowest = 0;
-  for (const Case& c : whileAway) {
-    const auto t0 = Clock::now();
-    EXPECT_EQ(field(sim.call(c.command), c.name), c.want) << c.command;
-    EXPECT_LT(msSince(t0), 6000) << c.command;
-    slowest = std::max(slowest, msSince(t0));
-  }
-  RecordProperty("slowest_call_while_away_ms", static_cast<int>(slowest));
-
-  mark = daemon->err().size();
-  const auto back = Clock::now();
-  ASSERT_NO_FATAL_FAILURE(startModem());
-  ASSERT_TRUE(daemon->err().waitFor("AT port back", mark));
-  EXPECT_TRUE(servedWithin(sim, 10000 - msSince(back)));
-  RecordProperty("served_after_restart_ms", static_cast<int>(msSince(back)));
-  EXPECT_EQ(echo(sim, old, "33"), "");  // the old session went with the modem
-  const int ch = openEcho(sim);
-  EXPECT_EQ(echo(sim, ch, "44"), "449000");
-}
-
-// The modem's port appears only after SIM1's first init has given up its
-// start attempts: calls fail until then, and SIM1 serves once it is there.
-TEST_P(SimFaults, AModemThatComesUpLateIsServed) {
-  daemon = startDaemon(root);
-  SecliSession sim(root, "SIM1");
-  const size_t mark = daemon->err().size();
-  sim.send("init");
-  ASSERT_TRUE(daemon->err().waitFor("still waiting for the AT port", mark));
-  EXPECT_EQ(field(answerOf(sim), "state"), "true");
-  const auto t0 = Clock::now();
-  EXPECT_EQ(field(sim.call("present"), "present"), "false");
-  EXPECT_LT(msSince(t0), 6000);
-
-  const auto up = Clock::now();
-  ASSERT_NO_FATAL_FAILURE(startModem());
-  ASSERT_TRUE(daemon->err().waitFor("AT port back", mark));
-  EXPECT_TRUE(servedWithin(sim, 10000));
-  RecordProperty("served_after_start_ms", static_cast<int>(msSince(up)));
-  const int ch = openEcho(sim);
-  EXPECT_EQ(echo(sim, ch, "55"), "559000");
-}
-
-// A +CGLA:/+CSIM: answer whose length field is shorter than its text is a
-// failure: never a response cut before its status word.
-TEST_P(SimFaults, AShortLengthFieldGivesAFailure) {
-  ASSERT_NO_FATAL_FAILURE(startModem({"--short-length"}));
-  daemon = startDaemon(root);
-  SecliSession sim(root, "SIM1");
-  ASSERT_TRUE(initSim(sim));
-  EXPECT_EQ(field(sim.call(kBasicGetData), "response"), "");
-  // The open's SELECT answer is malformed too: the open fails and the
-  // session the modem gave is released.
-  const std::string open = sim.call(std::string("open ") + kEchoAid);
-  EXPECT_EQ(field(open, "status"), "FAILED") << open;
-  EXPECT_TRUE(modem->err().waitFor("< AT+CCHC=257"));
-}
-
-// A healthy but slow modem (150 ms per answer) and three SIM1 clients at
-// once: nobody gives up, every answer is right.
-TEST_P(SimFaults, ASlowModemServesEveryWaitingClient) {
-  ASSERT_NO_FATAL_FAILURE(startModem({"--delay", "150"}));
-  daemon = startDaemon(root);
-  std::vector<std::unique_ptr<SecliSession>> clients;
-  for (int i = 0; i < 3; ++i) {
-    clients.push_back(std::make_unique<SecliSession>(root, "SIM1"));
-    ASSERT_TRUE(initSim(*clients.back()));
-  }
-  for (auto& c : clients) c->send(std::string("open ") + kEchoAid);
-  std::vector<int> channels;
-  for (auto& c : clients) {
-    const std::string open = answerOf(*c);
-    EXPECT_EQ(field(open, "status"), "SUCCESS") << open;
-    channels.push_back(std::atoi(field(open, "channel").c_str()));
-  }
-  for (int round = 0; round < 2; ++round) {
-    for (size_t i = 0; i < clients.size(); ++i) {
-      clients[i]->send(echoCommand(channels[i], hexByte(0x10 * round + static_cast<int>(i))));
-    }
-    for (size_t i = 0; i < clients.size(); ++i) {
-      EXPECT_EQ(field(answerOf(*clients[i]), "response"),
-                hexByte(0x10 * round + static_cast<int>(i)) + "9000");
-    }
-  }
-  EXPECT_EQ(daemon->err().text().find("given up"), std::string::npos);
-}
-
-INSTANTIATE_TEST_SUITE_P(OpenForms, SimFaults,
-                         ::testing::Values(OpenForm::kPrefixed, OpenForm::kBare),
-                         [](const ::testing::TestParamInfo<OpenForm>& info) {
-                           return info.param == OpenForm::kBare ? "Bare" : "Prefixed";
-                         });
-
-class EseFaults : public FaultsBase, public ::testing::Test {
- protected:
-  void TearDown() override { tearDown(HasFailure()); }
-  std::string openChannelsOnTheCard() {
-    std::ifstream in(root.at("data/vendor/ese_sim/open_channels"));
-    if (!in) return "(no report)";
-    std::stringstream ss;
-    ss << in.rdbuf();
-    return ss.str();
-  }
-};
 
 // The card hands out channels above 3: each open is refused, and the channel
 // is closed on the card, so none is left open and none is used up.
@@ -355,7 +296,7 @@ TEST_F(EseFaults, ARefusedChannelIsNotLeftOpenOnTheCard) {
   // 6A 81 on the fifth.
   for (int i = 0; i < 5; ++i) {
     SCOPED_TRACE(i);
-    const std::string open = ese.call(std::string("open ") + kEchoAid);
+    const std::string open = ese.call(std::string("open ") + kEchoApplet);
     EXPECT_EQ(field(open, "status"), "CHANNEL_NOT_AVAILABLE") << open;
     EXPECT_EQ(field(open, "channel"), "255") << open;
     EXPECT_EQ(openChannelsOnTheCard(), "\n");
@@ -367,28 +308,6 @@ TEST_F(EseFaults, ARefusedChannelIsNotLeftOpenOnTheCard) {
   EXPECT_EQ(ch, 1);
   EXPECT_EQ(openChannelsOnTheCard(), "1\n");
   EXPECT_EQ(echo(ese, ch, "66"), "669000");
-}
-
-// Several eSE1 clients at once on a healthy library: all served, right.
-TEST_F(EseFaults, ConcurrentClientsAreAllServed) {
-  daemon = startDaemon(root);
-  std::vector<std::unique_ptr<SecliSession>> clients;
-  std::vector<int> channels;
-  for (int i = 0; i < 3; ++i) {
-    clients.push_back(std::make_unique<SecliSession>(root, "eSE1"));
-    ASSERT_EQ(field(clients.back()->call("init"), "state"), "true");
-    channels.push_back(openEcho(*clients.back()));
-  }
-  constexpr int kRounds = 30;
-  for (size_t i = 0; i < clients.size(); ++i) {
-    for (int r = 0; r < kRounds; ++r) clients[i]->send(echoCommand(channels[i], hexByte(r)));
-  }
-  for (size_t i = 0; i < clients.size(); ++i) {
-    for (int r = 0; r < kRounds; ++r) {
-      EXPECT_EQ(field(answerOf(*clients[i]), "response"), hexByte(r) + "9000");
-    }
-  }
-  EXPECT_EQ(daemon->err().text().find("giving up"), std::string::npos);
 }
 
 }  // namespace

@@ -36,14 +36,17 @@ TempRoot::~TempRoot() {
   fs::remove_all(path_, ec);
 }
 
+static void put(const std::string& path, const std::string& content, std::ios::openmode mode) {
+  fs::create_directories(fs::path(path).parent_path());
+  std::ofstream(path, mode) << content;
+}
+
 void TempRoot::write(const std::string& rel, const std::string& content) const {
-  fs::create_directories(fs::path(at(rel)).parent_path());
-  std::ofstream(at(rel), std::ios::trunc) << content;
+  put(at(rel), content, std::ios::trunc);
 }
 
 void TempRoot::append(const std::string& rel, const std::string& content) const {
-  fs::create_directories(fs::path(at(rel)).parent_path());
-  std::ofstream(at(rel), std::ios::app) << content;
+  put(at(rel), content, std::ios::app);
 }
 
 Output::Output(int fd) : fd_(fd), thread_([this] { run(); }) {}
@@ -73,12 +76,10 @@ bool Output::waitFor(const std::string& needle, size_t from, int ms) {
 bool Output::nextLine(size_t* pos, std::string* line, int ms) {
   std::unique_lock<std::mutex> l(mu_);
   // A child that has ended gives no more lines.
-  if (!cv_.wait_for(l, std::chrono::milliseconds(ms),
-                    [&] { return eof_ || text_.find('\n', *pos) != std::string::npos; }) ||
-      text_.find('\n', *pos) == std::string::npos) {
-    return false;
-  }
+  cv_.wait_for(l, std::chrono::milliseconds(ms),
+               [&] { return eof_ || text_.find('\n', *pos) != std::string::npos; });
   const size_t nl = text_.find('\n', *pos);
+  if (nl == std::string::npos) return false;
   *line = text_.substr(*pos, nl - *pos);
   *pos = nl + 1;
   return true;
@@ -271,9 +272,8 @@ std::string field(const std::string& json, const std::string& name) {
 }
 
 std::string hexByte(int v) {
-  char b[3];
-  snprintf(b, sizeof(b), "%02X", v & 0xFF);
-  return b;
+  const char* digits = "0123456789ABCDEF";
+  return {digits[(v >> 4) & 0xF], digits[v & 0xF]};
 }
 
 size_t countOf(const std::string& text, const std::string& needle) {
@@ -282,6 +282,36 @@ size_t countOf(const std::string& text, const std::string& needle) {
     ++n;
   }
   return n;
+}
+
+System::~System() {
+  if (daemon) {
+    daemon->stop(SIGKILL);
+    expectNoSanitizerReport("daemon", daemon->err().text());
+  }
+  if (!::testing::Test::HasFailure()) return;
+  if (daemon) fprintf(stderr, "---- daemon ----\n%s", daemon->err().text().c_str());
+  if (modem) fprintf(stderr, "---- modem ----\n%s", modem->err().text().c_str());
+}
+
+int openEcho(SecliSession& s) {
+  const std::string open = s.call(std::string("open ") + kEchoApplet);
+  EXPECT_EQ(field(open, "status"), "SUCCESS") << open;
+  return field(open, "status") == "SUCCESS" ? atoi(field(open, "channel").c_str()) : -1;
+}
+
+std::string echoCommand(int channel, const std::string& byte) {
+  return "transmit " + hexByte(channel) + " 01 00 00 01 " + byte;
+}
+
+std::string echo(SecliSession& s, int channel, const std::string& byte) {
+  return field(s.call(echoCommand(channel, byte)), "response");
+}
+
+long msSince(std::chrono::steady_clock::time_point t0) {
+  return static_cast<long>(std::chrono::duration_cast<std::chrono::milliseconds>(
+                               std::chrono::steady_clock::now() - t0)
+                               .count());
 }
 
 void expectNoSanitizerReport(const std::string& who, const std::string& text) {

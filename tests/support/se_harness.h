@@ -6,6 +6,7 @@
 // dies with the test process (parent-death signal) should that crash.
 #include <sys/types.h>
 
+#include <chrono>
 #include <condition_variable>
 #include <memory>
 #include <mutex>
@@ -51,7 +52,6 @@ class Output {
 
   std::string text();
   size_t size();
-  // True once `needle` appears at or after byte `from`.
   bool waitFor(const std::string& needle, size_t from = 0, int ms = kGenerousMs);
   // The next complete line at or after byte *pos; *pos moves past it.
   // False at once when the child's output has ended without one.
@@ -79,8 +79,8 @@ class Process {
 
   void write(const std::string& text);
   void closeStdin();
-  // Sends `sig` and reaps the child; its output is complete afterwards.
-  void stop(int sig);
+  void stop(int sig);  // sends `sig`, reaps; the output is complete after
+
   // Exit code once the child ended on its own (128 + signal when killed);
   // -1 when it did not end within `ms`.
   int waitExit(int ms = kGenerousMs);
@@ -111,7 +111,6 @@ class SecliSession {
   SecliSession(const TempRoot& root, const std::string& instance,
                const std::vector<std::string>& extra = {});
   ~SecliSession();
-  // Sends one command and returns its JSON line.
   std::string call(const std::string& command, int ms = kGenerousMs);
   // Sends without waiting; `answer` collects it later.
   void send(const std::string& command);
@@ -134,5 +133,22 @@ size_t countOf(const std::string& text, const std::string& needle);
 // A sanitizer build reports into the process's standard error and may go on
 // running; such a report fails the test.
 void expectNoSanitizerReport(const std::string& who, const std::string& text);
+
+// For the end-to-end suites: the daemon and modem-sim on one root. Stops the
+// daemon first (no port in use when the modem goes), checks it for sanitizer
+// reports and prints both logs when the test has failed.
+struct System {
+  ~System();
+  TempRoot root;
+  std::unique_ptr<Process> modem;
+  std::unique_ptr<Process> daemon;
+};
+constexpr const char* kEchoApplet = "A00000000101";
+// An open of the echo applet; its channel, or -1.
+int openEcho(SecliSession& s);
+std::string echoCommand(int channel, const std::string& byte);
+// The echo applet's response to one byte on `channel`.
+std::string echo(SecliSession& s, int channel, const std::string& byte);
+long msSince(std::chrono::steady_clock::time_point t0);
 
 }  // namespace se_test
