@@ -1,6 +1,5 @@
-// End to end on "SIM1": the real daemon, one or two modem-sim processes and
-// secli, all in a fresh device root. A killed client and a lost modem are in
-// the integration suite.
+// End to end on "SIM1": the real daemon, a modem-sim process and secli, all
+// in a fresh device root; the modem selection is in the front's tests.
 #include <gtest/gtest.h>
 
 #include <signal.h>
@@ -74,22 +73,19 @@ TEST_F(SimEndToEnd, OneModemChannelsAndApdus) {
                            "close 1\nclose 2\n" +
                            "transmit 02 01 00 00 01 AA\n" +   // closed: empty answer
                            "basic " + kEchoAid + "\n");
+  // What each line of the answer holds, in order.
+  const char* const want[] = {"\"state\":true", "\"present\":true", "\"atr\":\"3B",
+                              "\"status\":\"SUCCESS\",\"channel\":1", "\"response\":\"009000\"",
+                              "\"status\":\"SUCCESS\",\"channel\":2", "\"response\":\"ABCD9000\"",
+                              "\"response\":\"9F7F", "\"status\":\"SUCCESS\"", "\"status\":\"SUCCESS\"",
+                              "\"response\":\"\"", "\"status\":\"CHANNEL_NOT_AVAILABLE\""};
   std::istringstream lines(out);
-  std::vector<std::string> l;
-  for (std::string s; std::getline(lines, s);) l.push_back(s);
-  ASSERT_EQ(12u, l.size()) << out;
-  EXPECT_EQ("{\"cmd\":\"init\",\"state\":true}", l[0]);
-  EXPECT_EQ("{\"cmd\":\"present\",\"present\":true}", l[1]);
-  EXPECT_NE(std::string::npos, l[2].find("\"atr\":\"3B")) << l[2];
-  EXPECT_NE(std::string::npos, l[3].find("\"status\":\"SUCCESS\",\"channel\":1")) << l[3];
-  EXPECT_NE(std::string::npos, l[4].find("\"response\":\"009000\"")) << l[4];
-  EXPECT_NE(std::string::npos, l[5].find("\"status\":\"SUCCESS\",\"channel\":2")) << l[5];
-  EXPECT_NE(std::string::npos, l[6].find("\"response\":\"ABCD9000\"")) << l[6];
-  EXPECT_NE(std::string::npos, l[7].find("\"response\":\"9F7F")) << l[7];
-  EXPECT_NE(std::string::npos, l[8].find("\"status\":\"SUCCESS\"")) << l[8];
-  EXPECT_NE(std::string::npos, l[9].find("\"status\":\"SUCCESS\"")) << l[9];
-  EXPECT_NE(std::string::npos, l[10].find("\"response\":\"\"")) << l[10];
-  EXPECT_NE(std::string::npos, l[11].find("\"status\":\"CHANNEL_NOT_AVAILABLE\"")) << l[11];
+  std::string line;
+  for (const char* w : want) {
+    ASSERT_TRUE(std::getline(lines, line)) << out;
+    EXPECT_NE(std::string::npos, line.find(w)) << line;
+  }
+  EXPECT_FALSE(std::getline(lines, line)) << out;
 
   std::string log = fileText(modemLog(0));
   for (const char* sent : {"< AT+CCHO=\"A00000000103\"", "< AT+CGLA=257,22,\"00A4040006A00000000103\"",
@@ -97,30 +93,6 @@ TEST_F(SimEndToEnd, OneModemChannelsAndApdus) {
                            "< AT+CSIM=10,\"00CA9F7F00\"", "< AT+CCHC=257", "< AT+CCHC=258"}) {
     EXPECT_NE(std::string::npos, log.find(sent)) << sent << "\n" << log;
   }
-}
-
-TEST_F(SimEndToEnd, TwoModemsFollowTheSwitchAndTheSlotOrder) {
-  root_.write("properties", "ro.odm.config.modem_number=2\n");
-  for (const char* node : {"nfc_sim_switch", "nfc_card_num", "nfc_wired_ese_type"}) {
-    root_.write(std::string("sys/nfc/") + node, "0");
-  }
-  startModem(0);
-  startModem(1, {"--card-absent"});
-  startDaemon();
-  EXPECT_NE(std::string::npos, script("init\n").find("\"state\":true"));
-
-  // NFC on SIM 1, normal slot order: modem 0, whose card is there.
-  EXPECT_NE(std::string::npos, script("present\n").find("\"present\":true"));
-  // Switched to SIM 2: modem 1, without a card.
-  root_.write("sys/nfc/nfc_sim_switch", "2");
-  root_.write("sys/nfc/nfc_card_num", "3");
-  EXPECT_NE(std::string::npos, script("present\n").find("\"present\":false"));
-  // Slots swapped: SIM 2 is on modem 0 again.
-  root_.append("properties", "persist.odm.radio.sim_slot_cfg=1,0\n");
-  EXPECT_NE(std::string::npos, script("present\n").find("\"present\":true"));
-
-  EXPECT_EQ(2u, countOf(fileText(modemLog(0)), "< AT^CARDTYPE?"));
-  EXPECT_EQ(1u, countOf(fileText(modemLog(1)), "< AT^CARDTYPE?"));
 }
 
 }  // namespace
