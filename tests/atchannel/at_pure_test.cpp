@@ -3,6 +3,7 @@
 #include <gtest/gtest.h>
 #include <host/log_capture.h>
 
+#include <algorithm>
 #include <cctype>
 #include <cstdint>
 #include <cstring>
@@ -32,23 +33,14 @@ struct Script {
 int32_t scriptRead(void* arg, char* dest, int32_t max_len) {
   auto* s = static_cast<Script*>(arg);
   ++s->reads;
-  while (s->idx < s->pieces.size()) {
-    Piece& p = s->pieces[s->idx];
-    if (p.fail) {
+  for (; s->idx < s->pieces.size(); ++s->idx, s->off = 0) {
+    const Piece& p = s->pieces[s->idx];
+    if (p.fail || p.eof) {
       ++s->idx;
-      return -1;
+      return p.fail ? -1 : 0;
     }
-    if (p.eof) {
-      ++s->idx;
-      return 0;
-    }
-    size_t left = p.data.size() - s->off;
-    if (left == 0) {
-      ++s->idx;
-      s->off = 0;
-      continue;
-    }
-    size_t n = left < static_cast<size_t>(max_len) ? left : static_cast<size_t>(max_len);
+    size_t n = std::min(p.data.size() - s->off, static_cast<size_t>(max_len));
+    if (n == 0) continue;
     memcpy(dest, p.data.data() + s->off, n);
     s->off += n;
     return static_cast<int32_t>(n);
@@ -175,24 +167,17 @@ TEST(LineCutter, EdgeCases) {
   }
 }
 
-TEST(LineCutter, LinesOfOneReadComeOutWithoutReadingAgain) {
+// Lines of one read come out without reading again; a failed read is told.
+TEST(LineCutter, ReadsOnlyWhenNeeded) {
   Script s;
-  s.pieces = {{"+CCHO: 7\r\nOK\r\n"}};
+  s.pieces = {{"+CCHO: 7\r\nOK\r\n"}, {"PART"}, {"", false, true}};
   Cutter c;
   std::string line;
-  ASSERT_EQ(c.next(s, &line), AT_LINE_READY);
-  EXPECT_EQ(line, "+CCHO: 7");
-  ASSERT_EQ(c.next(s, &line), AT_LINE_READY);
-  EXPECT_EQ(line, "OK");
+  for (const char* want : {"+CCHO: 7", "OK"}) {
+    ASSERT_EQ(c.next(s, &line), AT_LINE_READY);
+    EXPECT_EQ(line, want);
+  }
   EXPECT_EQ(s.reads, 1);
-  EXPECT_EQ(c.next(s, &line), AT_LINE_EOF);
-}
-
-TEST(LineCutter, ReadFailureIsReported) {
-  Script s;
-  s.pieces = {{"PART"}, {"", false, true}};
-  Cutter c;
-  std::string line;
   EXPECT_EQ(c.next(s, &line), AT_LINE_READ_ERROR);
 }
 
@@ -208,17 +193,11 @@ TEST(LineSorting, Table) {
   const Case cases[] = {
       {"OK", 0, at_type_none, 0, nullptr, AT_KIND_UNSOLICITED},
       {"OK", 1, at_type_none, 0, nullptr, AT_KIND_FINAL_SUCCESS},
-      {"OKAY", 1, at_type_none, 0, nullptr, AT_KIND_FINAL_SUCCESS},
       {"ok", 1, at_type_none, 0, nullptr, AT_KIND_UNSOLICITED},
       {"CONNECT 9600", 1, at_type_none, 0, nullptr, AT_KIND_FINAL_SUCCESS},
       {"+CME ERROR: 4", 1, at_type_singleline, 0, "+CME", AT_KIND_FINAL_ERROR},
-      {"+CMS ERROR: 500", 1, at_type_none, 0, nullptr, AT_KIND_FINAL_ERROR},
       {"COMMAND NOT SUPPORT", 1, at_type_none, 0, nullptr, AT_KIND_FINAL_ERROR},
       {"NO CARRIER", 1, at_type_none, 0, nullptr, AT_KIND_FINAL_ERROR},
-      {"NO DIALTONE", 1, at_type_none, 0, nullptr, AT_KIND_FINAL_ERROR},
-      {"BUSY", 1, at_type_none, 0, nullptr, AT_KIND_FINAL_ERROR},
-      {"NO ANSWER", 1, at_type_none, 0, nullptr, AT_KIND_FINAL_ERROR},
-      {"ABORT", 1, at_type_none, 0, nullptr, AT_KIND_FINAL_ERROR},
       {"error", 1, at_type_none, 0, nullptr, AT_KIND_UNSOLICITED},
       {"^CARDTYPE: 1,1,0", 1, at_type_singleline, 0, "^CARDTYPE:", AT_KIND_INTERMEDIATE},
       {"^CARDTYPE: 1,1,0", 1, at_type_singleline, 1, "^CARDTYPE:", AT_KIND_UNSOLICITED},
@@ -232,12 +211,8 @@ TEST(LineSorting, Table) {
     EXPECT_EQ(at_classify_line(c.line, c.pending, c.type, c.hasIntermediate, c.prefix), c.want)
         << c.line << " pending=" << c.pending << " type=" << c.type;
   }
-  EXPECT_TRUE(at_is_sms_unsolicited("+CMT: 1"));
-  EXPECT_TRUE(at_is_sms_unsolicited("^BST: x"));
-  EXPECT_TRUE(at_is_sms_unsolicited("+CDS: 2"));
-  EXPECT_TRUE(at_is_sms_unsolicited("+CBM: 3"));
-  EXPECT_FALSE(at_is_sms_unsolicited("+CMTI: 1"));
-  EXPECT_FALSE(at_is_sms_unsolicited("+cmt: 1"));
+  for (const char* sms : {"+CMT: 1", "^BST: x", "+CDS: 2", "+CBM: 3"}) EXPECT_TRUE(at_is_sms_unsolicited(sms));
+  for (const char* other : {"+CMTI: 1", "+cmt: 1"}) EXPECT_FALSE(at_is_sms_unsolicited(other));
 }
 
 TEST(Masking, WordsAreFoundInTableOrderWithoutRegardToCase) {
@@ -249,19 +224,14 @@ TEST(Masking, WordsAreFoundInTableOrderWithoutRegardToCase) {
       {"AT+CCHO=\"A0000000031010\"", "CCHO="},
       {"AT+CCHP=\"A000\",4", "CCHP="},
       {"AT+CGLA=1,10,\"00A4040005\"", "CGLA"},
-      {"+CGLA: 4,\"9000\"", "CGLA"},
       {"AT+CSIM=10,\"00B0\"", "CSIM="},
       {"+CSIM: 4,\"6A82\"", "CSIM:"},
       {"at+cpin2=1234", "CPIN2="},
-      {"AT+CPIN=1234", "CPIN="},
       {"+CLCCECONF: 1", "CLCC"},   // CLCC comes before CLCCECONF in the table
       {"ATD123;", "ATD"},
       {"x cgcontrdp y", "CGCONTRDP"},
       {"AT^CARDTYPE?", nullptr},
-      {"AT^CARDATR", nullptr},
-      {"^CARDTYPE: 1,1,0", nullptr},
       {"+CCHO: 7", nullptr},
-      {"OK", nullptr},
       {"", nullptr},
   };
   for (const Case& c : cases) {
@@ -323,7 +293,6 @@ TEST(Tokenizer, Table) {
   const std::vector<Case> cases = {
       {"^CARDTYPE: 1,1,0", 0, {{'i', 0, 1, nullptr}, {'i', 0, 1, nullptr}, {'i', 0, 0, nullptr}, {'i', -1, 99, nullptr}}},
       {"+CGLA: 4,\"9000\"", 0, {{'i', 0, 4, nullptr}, {'s', 0, 0, "9000"}, {'s', 0, 0, ""}, {'s', -1, 0, nullptr}}},
-      {"+X: \"12\",7", 0, {{'i', 0, 12, nullptr}, {'i', 0, 7, nullptr}}},
       {"+X: AB,12AB,0x1F,-5", 0, {{'i', -1, 0, nullptr}, {'i', 0, 12, nullptr}, {'i', 0, 0, nullptr}, {'i', 0, -5, nullptr}}},
       {"+X:   \t\"a b\" junk ,  c d", 0, {{'s', 0, 0, "a b"}, {'s', 0, 0, "c d"}, {'s', -1, 0, nullptr}}},
       {"+X: \"open", 0, {{'s', 0, 0, "open"}, {'s', -1, 0, nullptr}}},
@@ -371,7 +340,6 @@ TEST(CmeError, Table) {
       {1, "OK", 0},
       {0, "+CME ERROR: 4", 4},
       {0, "+CME ERROR: 716,extra", 716},
-      {0, "+CME ERROR:", -1},
       {0, "+CME ERROR: x", -1},
       {0, "ERROR", -1},
       {0, "+cme error: 4", -1},
