@@ -234,15 +234,7 @@ TEST(Masking, WordsAreFoundInTableOrderWithoutRegardToCase) {
       {"+CCHO: 7", nullptr},
       {"", nullptr},
   };
-  for (const Case& c : cases) {
-    const char* got = at_mask_find(c.text);
-    if (c.word == nullptr) {
-      EXPECT_EQ(got, nullptr) << c.text << " matched " << got;
-    } else {
-      ASSERT_NE(got, nullptr) << c.text;
-      EXPECT_STREQ(got, c.word) << c.text;
-    }
-  }
+  for (const Case& c : cases) EXPECT_STREQ(c.word, at_mask_find(c.text)) << c.text;
 }
 
 // The search runs once over the text; it must still give the word that
@@ -268,12 +260,7 @@ TEST(Masking, SinglePassAgreesWithWordByWordSearch) {
       seed = seed * 1103515245u + 12345u;
       text += pieces[(seed >> 16) % (sizeof(pieces) / sizeof(pieces[0]))];
     }
-    const char* want = plain(text);
-    const char* got = at_mask_find(text.c_str());
-    ASSERT_EQ(got == nullptr, want == nullptr) << text;
-    if (want != nullptr) {
-      ASSERT_STREQ(got, want) << text;
-    }
+    ASSERT_STREQ(plain(text), at_mask_find(text.c_str())) << text;
   }
 }
 

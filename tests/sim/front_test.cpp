@@ -83,19 +83,6 @@ class Front : public sim_test::EngineTest {
   sp<ZerbSimSecureElement> se_;
 };
 
-TEST_F(Front, EverythingFailsUntilAnInitWithCallback) {
-  se_->init(nullptr);
-  EXPECT_EQ(0, asyncCmdInited[0]);
-  EXPECT_FALSE(se_->isCardPresent());
-  EXPECT_TRUE(atr().empty());
-  EXPECT_TRUE(transmit({0x00, 0xA4, 0x04, 0x00}).empty());
-  OpenResult r = open({0xA0, 0x00}, 0);
-  EXPECT_EQ(SecureElementStatus::FAILED, r.status);
-  EXPECT_EQ(0, r.channel);
-  EXPECT_EQ(SecureElementStatus::FAILED, close(1));
-  EXPECT_TRUE(modem0_->commands().empty());
-}
-
 TEST_F(Front, OperationsTurnAnswersIntoResults) {
   initAndWait();
   modem0_->setScript(scriptOf({{"AT^CARDTYPE?", okLine("^CARDTYPE: 1,1,0")},
