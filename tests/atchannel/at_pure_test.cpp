@@ -295,18 +295,14 @@ TEST(Tokenizer, Table) {
       EXPECT_EQ(cur, nullptr) << c.line;
     }
     for (size_t i = 0; i < c.steps.size(); ++i) {
+      SCOPED_TRACE(::testing::Message() << c.line << " step " << i);
       const Step& s = c.steps[i];
-      if (s.op == 'i') {
-        int32_t v = 99;
-        EXPECT_EQ(at_tok_nextint(&cur, &v), s.rc) << c.line << " step " << i;
-        EXPECT_EQ(v, s.ival) << c.line << " step " << i;
-      } else {
-        char* out = nullptr;
-        EXPECT_EQ(at_tok_nextstr(&cur, &out), s.rc) << c.line << " step " << i;
-        if (s.sval != nullptr) {
-          ASSERT_NE(out, nullptr);
-          EXPECT_STREQ(out, s.sval) << c.line << " step " << i;
-        }
+      int32_t v = 99;
+      char* out = nullptr;
+      EXPECT_EQ(s.op == 'i' ? at_tok_nextint(&cur, &v) : at_tok_nextstr(&cur, &out), s.rc);
+      EXPECT_EQ(s.op == 'i' ? s.ival : 99, v);
+      if (s.sval != nullptr) {
+        EXPECT_STREQ(s.sval, out);
       }
     }
   }
@@ -318,26 +314,14 @@ TEST(Tokenizer, Table) {
 }
 
 TEST(CmeError, Table) {
-  struct Case {
-    int32_t success;
-    const char* final_line;
-    int32_t want;
-  };
-  const Case cases[] = {
-      {1, "OK", 0},
-      {0, "+CME ERROR: 4", 4},
-      {0, "+CME ERROR: 716,extra", 716},
-      {0, "+CME ERROR: x", -1},
-      {0, "ERROR", -1},
-      {0, "+cme error: 4", -1},
-      {0, nullptr, -1},
-  };
-  for (const Case& c : cases) {
+  const std::pair<const char*, int32_t> cases[] = {{"OK", 0},      {"+CME ERROR: 716,extra", 716}, {"+CME ERROR: x", -1},
+                                                   {"ERROR", -1},  {"+cme error: 4", -1},          {nullptr, -1}};
+  for (const auto& c : cases) {
+    std::string text = c.first ? c.first : "";
     ATResponse r = {};
-    r.success = c.success;
-    std::string text = c.final_line ? c.final_line : "";
-    r.final_response = c.final_line ? &text[0] : nullptr;
-    EXPECT_EQ(at_get_cme_error(&r), c.want) << (c.final_line ? c.final_line : "(none)");
+    r.success = c.second == 0 ? 1 : 0;
+    r.final_response = c.first ? &text[0] : nullptr;
+    EXPECT_EQ(at_get_cme_error(&r), c.second) << (c.first ? c.first : "(none)");
   }
   EXPECT_EQ(at_get_cme_error(nullptr), -1);
   at_response_free(nullptr);
