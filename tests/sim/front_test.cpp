@@ -59,7 +59,7 @@ class Front : public sim_test::EngineTest {
     sp<StateCallback> callback = sp<StateCallback>::make();
     se_->init(callback);
     ASSERT_EQ(std::vector<bool>{true}, callback->states);
-    for (int m = 0; m < modems; m++) ASSERT_EQ(1, atPortOpened[m].load());
+    for (int m = 0; m < modems; m++) ASSERT_TRUE(waitUntil([m] { return atPortOpened[m] == 1; }));
   }
   OpenResult open(const Bytes& aid, uint8_t p2) {
     OpenResult r;
