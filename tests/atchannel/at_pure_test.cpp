@@ -3,6 +3,7 @@
 #include <gtest/gtest.h>
 #include <host/log_capture.h>
 
+#include <algorithm>
 #include <cctype>
 #include <cstdint>
 #include <cstring>
@@ -32,23 +33,14 @@ struct Script {
 int32_t scriptRead(void* arg, char* dest, int32_t max_len) {
   auto* s = static_cast<Script*>(arg);
   ++s->reads;
-  while (s->idx < s->pieces.size()) {
-    Piece& p = s->pieces[s->idx];
-    if (p.fail) {
+  for (; s->idx < s->pieces.size(); ++s->idx, s->off = 0) {
+    const Piece& p = s->pieces[s->idx];
+    if (p.fail || p.eof) {
       ++s->idx;
-      return -1;
+      return p.fail ? -1 : 0;
     }
-    if (p.eof) {
-      ++s->idx;
-      return 0;
-    }
-    size_t left = p.data.size() - s->off;
-    if (left == 0) {
-      ++s->idx;
-      s->off = 0;
-      continue;
-    }
-    size_t n = left < static_cast<size_t>(max_len) ? left : static_cast<size_t>(max_len);
+    size_t n = std::min(p.data.size() - s->off, static_cast<size_t>(max_len));
+    if (n == 0) continue;
     memcpy(dest, p.data.data() + s->off, n);
     s->off += n;
     return static_cast<int32_t>(n);
@@ -175,24 +167,17 @@ TEST(LineCutter, EdgeCases) {
   }
 }
 
-TEST(LineCutter, LinesOfOneReadComeOutWithoutReadingAgain) {
+// Lines of one read come out without reading again; a failed read is told.
+TEST(LineCutter, ReadsOnlyWhenNeeded) {
   Script s;
-  s.pieces = {{"+CCHO: 7\r\nOK\r\n"}};
+  s.pieces = {{"+CCHO: 7\r\nOK\r\n"}, {"PART"}, {"", false, true}};
   Cutter c;
   std::string line;
-  ASSERT_EQ(c.next(s, &line), AT_LINE_READY);
-  EXPECT_EQ(line, "+CCHO: 7");
-  ASSERT_EQ(c.next(s, &line), AT_LINE_READY);
-  EXPECT_EQ(line, "OK");
+  for (const char* want : {"+CCHO: 7", "OK"}) {
+    ASSERT_EQ(c.next(s, &line), AT_LINE_READY);
+    EXPECT_EQ(line, want);
+  }
   EXPECT_EQ(s.reads, 1);
-  EXPECT_EQ(c.next(s, &line), AT_LINE_EOF);
-}
-
-TEST(LineCutter, ReadFailureIsReported) {
-  Script s;
-  s.pieces = {{"PART"}, {"", false, true}};
-  Cutter c;
-  std::string line;
   EXPECT_EQ(c.next(s, &line), AT_LINE_READ_ERROR);
 }
 
@@ -208,17 +193,11 @@ TEST(LineSorting, Table) {
   const Case cases[] = {
       {"OK", 0, at_type_none, 0, nullptr, AT_KIND_UNSOLICITED},
       {"OK", 1, at_type_none, 0, nullptr, AT_KIND_FINAL_SUCCESS},
-      {"OKAY", 1, at_type_none, 0, nullptr, AT_KIND_FINAL_SUCCESS},
       {"ok", 1, at_type_none, 0, nullptr, AT_KIND_UNSOLICITED},
       {"CONNECT 9600", 1, at_type_none, 0, nullptr, AT_KIND_FINAL_SUCCESS},
       {"+CME ERROR: 4", 1, at_type_singleline, 0, "+CME", AT_KIND_FINAL_ERROR},
-      {"+CMS ERROR: 500", 1, at_type_none, 0, nullptr, AT_KIND_FINAL_ERROR},
       {"COMMAND NOT SUPPORT", 1, at_type_none, 0, nullptr, AT_KIND_FINAL_ERROR},
       {"NO CARRIER", 1, at_type_none, 0, nullptr, AT_KIND_FINAL_ERROR},
-      {"NO DIALTONE", 1, at_type_none, 0, nullptr, AT_KIND_FINAL_ERROR},
-      {"BUSY", 1, at_type_none, 0, nullptr, AT_KIND_FINAL_ERROR},
-      {"NO ANSWER", 1, at_type_none, 0, nullptr, AT_KIND_FINAL_ERROR},
-      {"ABORT", 1, at_type_none, 0, nullptr, AT_KIND_FINAL_ERROR},
       {"error", 1, at_type_none, 0, nullptr, AT_KIND_UNSOLICITED},
       {"^CARDTYPE: 1,1,0", 1, at_type_singleline, 0, "^CARDTYPE:", AT_KIND_INTERMEDIATE},
       {"^CARDTYPE: 1,1,0", 1, at_type_singleline, 1, "^CARDTYPE:", AT_KIND_UNSOLICITED},
@@ -232,12 +211,8 @@ TEST(LineSorting, Table) {
     EXPECT_EQ(at_classify_line(c.line, c.pending, c.type, c.hasIntermediate, c.prefix), c.want)
         << c.line << " pending=" << c.pending << " type=" << c.type;
   }
-  EXPECT_TRUE(at_is_sms_unsolicited("+CMT: 1"));
-  EXPECT_TRUE(at_is_sms_unsolicited("^BST: x"));
-  EXPECT_TRUE(at_is_sms_unsolicited("+CDS: 2"));
-  EXPECT_TRUE(at_is_sms_unsolicited("+CBM: 3"));
-  EXPECT_FALSE(at_is_sms_unsolicited("+CMTI: 1"));
-  EXPECT_FALSE(at_is_sms_unsolicited("+cmt: 1"));
+  for (const char* sms : {"+CMT: 1", "^BST: x", "+CDS: 2", "+CBM: 3"}) EXPECT_TRUE(at_is_sms_unsolicited(sms));
+  for (const char* other : {"+CMTI: 1", "+cmt: 1"}) EXPECT_FALSE(at_is_sms_unsolicited(other));
 }
 
 TEST(Masking, WordsAreFoundInTableOrderWithoutRegardToCase) {
@@ -249,30 +224,17 @@ TEST(Masking, WordsAreFoundInTableOrderWithoutRegardToCase) {
       {"AT+CCHO=\"A0000000031010\"", "CCHO="},
       {"AT+CCHP=\"A000\",4", "CCHP="},
       {"AT+CGLA=1,10,\"00A4040005\"", "CGLA"},
-      {"+CGLA: 4,\"9000\"", "CGLA"},
       {"AT+CSIM=10,\"00B0\"", "CSIM="},
       {"+CSIM: 4,\"6A82\"", "CSIM:"},
       {"at+cpin2=1234", "CPIN2="},
-      {"AT+CPIN=1234", "CPIN="},
       {"+CLCCECONF: 1", "CLCC"},   // CLCC comes before CLCCECONF in the table
       {"ATD123;", "ATD"},
       {"x cgcontrdp y", "CGCONTRDP"},
       {"AT^CARDTYPE?", nullptr},
-      {"AT^CARDATR", nullptr},
-      {"^CARDTYPE: 1,1,0", nullptr},
       {"+CCHO: 7", nullptr},
-      {"OK", nullptr},
       {"", nullptr},
   };
-  for (const Case& c : cases) {
-    const char* got = at_mask_find(c.text);
-    if (c.word == nullptr) {
-      EXPECT_EQ(got, nullptr) << c.text << " matched " << got;
-    } else {
-      ASSERT_NE(got, nullptr) << c.text;
-      EXPECT_STREQ(got, c.word) << c.text;
-    }
-  }
+  for (const Case& c : cases) EXPECT_STREQ(c.word, at_mask_find(c.text)) << c.text;
 }
 
 // The search runs once over the text; it must still give the word that
@@ -298,12 +260,7 @@ TEST(Masking, SinglePassAgreesWithWordByWordSearch) {
       seed = seed * 1103515245u + 12345u;
       text += pieces[(seed >> 16) % (sizeof(pieces) / sizeof(pieces[0]))];
     }
-    const char* want = plain(text);
-    const char* got = at_mask_find(text.c_str());
-    ASSERT_EQ(got == nullptr, want == nullptr) << text;
-    if (want != nullptr) {
-      ASSERT_STREQ(got, want) << text;
-    }
+    ASSERT_STREQ(plain(text), at_mask_find(text.c_str())) << text;
   }
 }
 
@@ -323,7 +280,6 @@ TEST(Tokenizer, Table) {
   const std::vector<Case> cases = {
       {"^CARDTYPE: 1,1,0", 0, {{'i', 0, 1, nullptr}, {'i', 0, 1, nullptr}, {'i', 0, 0, nullptr}, {'i', -1, 99, nullptr}}},
       {"+CGLA: 4,\"9000\"", 0, {{'i', 0, 4, nullptr}, {'s', 0, 0, "9000"}, {'s', 0, 0, ""}, {'s', -1, 0, nullptr}}},
-      {"+X: \"12\",7", 0, {{'i', 0, 12, nullptr}, {'i', 0, 7, nullptr}}},
       {"+X: AB,12AB,0x1F,-5", 0, {{'i', -1, 0, nullptr}, {'i', 0, 12, nullptr}, {'i', 0, 0, nullptr}, {'i', 0, -5, nullptr}}},
       {"+X:   \t\"a b\" junk ,  c d", 0, {{'s', 0, 0, "a b"}, {'s', 0, 0, "c d"}, {'s', -1, 0, nullptr}}},
       {"+X: \"open", 0, {{'s', 0, 0, "open"}, {'s', -1, 0, nullptr}}},
@@ -339,18 +295,14 @@ TEST(Tokenizer, Table) {
       EXPECT_EQ(cur, nullptr) << c.line;
     }
     for (size_t i = 0; i < c.steps.size(); ++i) {
+      SCOPED_TRACE(::testing::Message() << c.line << " step " << i);
       const Step& s = c.steps[i];
-      if (s.op == 'i') {
-        int32_t v = 99;
-        EXPECT_EQ(at_tok_nextint(&cur, &v), s.rc) << c.line << " step " << i;
-        EXPECT_EQ(v, s.ival) << c.line << " step " << i;
-      } else {
-        char* out = nullptr;
-        EXPECT_EQ(at_tok_nextstr(&cur, &out), s.rc) << c.line << " step " << i;
-        if (s.sval != nullptr) {
-          ASSERT_NE(out, nullptr);
-          EXPECT_STREQ(out, s.sval) << c.line << " step " << i;
-        }
+      int32_t v = 99;
+      char* out = nullptr;
+      EXPECT_EQ(s.op == 'i' ? at_tok_nextint(&cur, &v) : at_tok_nextstr(&cur, &out), s.rc);
+      EXPECT_EQ(s.op == 'i' ? s.ival : 99, v);
+      if (s.sval != nullptr) {
+        EXPECT_STREQ(s.sval, out);
       }
     }
   }
@@ -362,27 +314,14 @@ TEST(Tokenizer, Table) {
 }
 
 TEST(CmeError, Table) {
-  struct Case {
-    int32_t success;
-    const char* final_line;
-    int32_t want;
-  };
-  const Case cases[] = {
-      {1, "OK", 0},
-      {0, "+CME ERROR: 4", 4},
-      {0, "+CME ERROR: 716,extra", 716},
-      {0, "+CME ERROR:", -1},
-      {0, "+CME ERROR: x", -1},
-      {0, "ERROR", -1},
-      {0, "+cme error: 4", -1},
-      {0, nullptr, -1},
-  };
-  for (const Case& c : cases) {
+  const std::pair<const char*, int32_t> cases[] = {{"OK", 0},      {"+CME ERROR: 716,extra", 716}, {"+CME ERROR: x", -1},
+                                                   {"ERROR", -1},  {"+cme error: 4", -1},          {nullptr, -1}};
+  for (const auto& c : cases) {
+    std::string text = c.first ? c.first : "";
     ATResponse r = {};
-    r.success = c.success;
-    std::string text = c.final_line ? c.final_line : "";
-    r.final_response = c.final_line ? &text[0] : nullptr;
-    EXPECT_EQ(at_get_cme_error(&r), c.want) << (c.final_line ? c.final_line : "(none)");
+    r.success = c.second == 0 ? 1 : 0;
+    r.final_response = c.first ? &text[0] : nullptr;
+    EXPECT_EQ(at_get_cme_error(&r), c.second) << (c.first ? c.first : "(none)");
   }
   EXPECT_EQ(at_get_cme_error(nullptr), -1);
   at_response_free(nullptr);

@@ -71,9 +71,7 @@ class ScriptedModem {
   }
 
   ~ScriptedModem() {
-    char c = 1;
-    ssize_t n = write(stop_[1], &c, 1);
-    (void)n;
+    (void)!write(stop_[1], "x", 1);
     if (thread_.joinable()) thread_.join();
     if (!linkPath_.empty()) {
       unlink(linkPath_.c_str());
@@ -110,17 +108,6 @@ class ScriptedModem {
     std::lock_guard<std::mutex> g(m_);
     commands_.clear();
   }
-  bool received(const std::string& command) {
-    for (const std::string& c : commands()) {
-      if (c == command) return true;
-    }
-    return false;
-  }
-  // Every byte read from the port.
-  std::string raw() {
-    std::lock_guard<std::mutex> g(m_);
-    return raw_;
-  }
   // True once the far end has been closed.
   bool waitHangup(std::chrono::milliseconds limit = kGenerous) {
     std::unique_lock<std::mutex> g(m_);
@@ -156,10 +143,6 @@ class ScriptedModem {
         return;
       }
       pending.append(buf, static_cast<size_t>(n));
-      {
-        std::lock_guard<std::mutex> g(m_);
-        raw_.append(buf, static_cast<size_t>(n));
-      }
       size_t cr;
       while ((cr = pending.find('\r')) != std::string::npos) {
         std::string cmd = pending.substr(0, cr);
@@ -190,7 +173,6 @@ class ScriptedModem {
   std::condition_variable cv_;
   Script script_;
   std::vector<std::string> commands_;
-  std::string raw_;
   bool hungUp_ = false;
 };
 
