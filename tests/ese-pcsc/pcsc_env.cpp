@@ -24,19 +24,14 @@ namespace fs = std::filesystem;
 constexpr int kDefaultVpcdPort = 35963;
 const char* const kPcscdSocket = "/run/pcscd/pcscd.comm";
 
-std::string findFirst(const std::vector<std::string>& candidates) {
-  for (const std::string& c : candidates) {
-    if (access(c.c_str(), X_OK) == 0 || (c.find(".so") != std::string::npos && access(c.c_str(), R_OK) == 0)) {
-      return c;
-    }
-  }
+std::string firstOf(const std::vector<std::string>& paths) {
+  for (const std::string& p : paths)
+    if (access(p.c_str(), R_OK) == 0) return p;
   return "";
 }
-
-std::string pcscdPath() { return findFirst({"/usr/sbin/pcscd", "/sbin/pcscd", "/usr/local/sbin/pcscd"}); }
-
+std::string pcscdPath() { return firstOf({"/usr/sbin/pcscd", "/sbin/pcscd", "/usr/local/sbin/pcscd"}); }
 std::string vpcdDriver() {
-  return findFirst({"/usr/lib/pcsc/drivers/serial/libifdvpcd.so", "/usr/local/lib/pcsc/drivers/serial/libifdvpcd.so"});
+  return firstOf({"/usr/lib/pcsc/drivers/serial/libifdvpcd.so", "/usr/local/lib/pcsc/drivers/serial/libifdvpcd.so"});
 }
 
 // A pcscd answers on the machine-wide socket.
@@ -51,33 +46,26 @@ bool pcscdRunning() {
   return up;
 }
 
-bool bindable(int port) {
+// `port` bound on the loopback (0: any); the port taken, or 0.
+int bindPort(int port) {
   const int fd = socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
   sockaddr_in a{};
   a.sin_family = AF_INET;
   a.sin_port = htons(static_cast<uint16_t>(port));
   a.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
-  const bool ok = fd >= 0 && bind(fd, reinterpret_cast<sockaddr*>(&a), sizeof(a)) == 0;
+  socklen_t len = sizeof(a);
+  const bool ok = fd >= 0 && bind(fd, reinterpret_cast<sockaddr*>(&a), sizeof(a)) == 0 &&
+                  getsockname(fd, reinterpret_cast<sockaddr*>(&a), &len) == 0;
   if (fd >= 0) close(fd);
-  return ok;
+  return ok ? ntohs(a.sin_port) : 0;
 }
 
 // Two free ports in a row: vpcd listens on the configured port for its
 // first slot and on the next one for its second.
 int freePortPair() {
   for (int attempt = 0; attempt < 50; ++attempt) {
-    const int fd = socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
-    sockaddr_in a{};
-    a.sin_family = AF_INET;
-    a.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
-    socklen_t len = sizeof(a);
-    int port = 0;
-    if (fd >= 0 && bind(fd, reinterpret_cast<sockaddr*>(&a), sizeof(a)) == 0 &&
-        getsockname(fd, reinterpret_cast<sockaddr*>(&a), &len) == 0) {
-      port = ntohs(a.sin_port);
-    }
-    if (fd >= 0) close(fd);
-    if (port > 0 && port < 65535 && bindable(port) && bindable(port + 1)) return port;
+    const int port = bindPort(0);
+    if (port > 0 && port < 65535 && bindPort(port + 1)) return port;
   }
   return 0;
 }
@@ -124,11 +112,7 @@ void PcscEnv::startOwn() {
   config_ = std::make_unique<TempRoot>();
   config_->write("reader.conf.d/vpcd", "FRIENDLYNAME \"Virtual PCD\"\nDEVICENAME /dev/null:" + std::to_string(port_) +
                                            "\nLIBPATH " + vpcdDriver() + "\nCHANNELID " + std::to_string(port_) + "\n");
-  daemon_ = std::make_unique<Process>(
-      std::vector<std::string>{pcscdPath_, "--foreground", "--info", "-c", config_->at("reader.conf.d")},
-      config_->path());
-  ASSERT_TRUE(daemon_->out().waitFor("daemon ready") && waitSocket(kGenerousMs))
-      << "pcscd did not start:\n" << daemon_->out().text() << daemon_->err().text();
+  restartDaemon();
 }
 
 void PcscEnv::start() {
@@ -165,7 +149,7 @@ void PcscEnv::restartDaemon() {
       std::vector<std::string>{pcscdPath_, "--foreground", "--info", "-c", config_->at("reader.conf.d")},
       config_->path());
   ASSERT_TRUE(daemon_->out().waitFor("daemon ready") && waitSocket(kGenerousMs))
-      << daemon_->out().text() << daemon_->err().text();
+      << "pcscd did not start:\n" << daemon_->out().text() << daemon_->err().text();
 }
 
 bool PcscEnv::waitCard(bool present, int ms) {
@@ -180,20 +164,13 @@ bool PcscEnv::waitCard(bool present, int ms) {
   s.dwCurrentState = SCARD_STATE_UNAWARE;
   const auto deadline = std::chrono::steady_clock::now() + std::chrono::milliseconds(ms);
   bool reached = false;
-  for (;;) {
+  // Each round waits for the next change from what was seen; a time-out or
+  // pcscd gone ends it.
+  while (!reached) {
     const auto left = std::chrono::duration_cast<std::chrono::milliseconds>(deadline - std::chrono::steady_clock::now());
-    const LONG rv = SCardGetStatusChange(ctx, static_cast<DWORD>(std::max<long>(0, left.count())), &s, 1);
-    if (rv == SCARD_S_SUCCESS) {
-      const bool isPresent = (s.dwEventState & SCARD_STATE_PRESENT) != 0;
-      if (isPresent == present) {
-        reached = true;
-        break;
-      }
-      // Wait for the next change from what was seen.
-      s.dwCurrentState = s.dwEventState & ~SCARD_STATE_CHANGED;
-      continue;
-    }
-    break;  // time-out or pcscd gone
+    if (SCardGetStatusChange(ctx, static_cast<DWORD>(std::max<long>(0, left.count())), &s, 1) != SCARD_S_SUCCESS) break;
+    reached = ((s.dwEventState & SCARD_STATE_PRESENT) != 0) == present;
+    s.dwCurrentState = s.dwEventState & ~SCARD_STATE_CHANGED;
   }
   SCardReleaseContext(ctx);
   return reached;

@@ -27,17 +27,14 @@ class PcscEnv {
   PcscEnv(const PcscEnv&) = delete;
   PcscEnv& operator=(const PcscEnv&) = delete;
 
-  // Why pcscd cannot run on this machine at all ("" when it can): no pcscd
-  // or no vpcd driver installed.
+  // Why pcscd cannot run here at all ("" when it can).
   static std::string unavailable();
 
-  // Our pcscd when none runs (waits for its "daemon ready"), else the one
-  // running, which must serve a vpcd reader on the default port. Fails the
-  // test with the reason when neither works.
+  // Our pcscd when none runs, else the one running, which must serve a vpcd
+  // reader on the default port; fails the test with the reason otherwise.
   void start();
   bool ours() const { return daemon_ != nullptr; }
-  // Only ours: pcscd stopped (as a reader unplugged, for the library) and
-  // started again on the same configuration.
+  // Only ours: pcscd stopped (a reader unplugged) and started again.
   void stopDaemon();
   void restartDaemon();
 
@@ -45,9 +42,9 @@ class PcscEnv {
   // The vpcd slot card-vpcd serves: "Virtual PCD 00 00".
   const std::string& reader() const { return reader_; }
 
-  // card-vpcd on our port; waits until pcscd sees the card.
+  // card-vpcd on our port, until pcscd sees the card; removeCard pulls it
+  // out (SIGTERM) until pcscd sees it gone.
   std::unique_ptr<Process> startCard(const std::vector<std::string>& extra = {});
-  // Pulls the card out (SIGTERM) and waits until pcscd sees it gone.
   void removeCard(std::unique_ptr<Process>& card);
   // Until the reader reports a card (or none); false after `ms`.
   bool waitCard(bool present, int ms = kGenerousMs);

@@ -1,19 +1,11 @@
 // The simulated vendor library called in-process, as the daemon calls it.
 #include <gtest/gtest.h>
 
-#include <fcntl.h>
 #include <stdlib.h>
 
-#include <condition_variable>
 #include <cstring>
-#include <fstream>
-#include <functional>
-#include <future>
-#include <mutex>
-#include <sstream>
 #include <string>
 #include <thread>
-#include <tuple>
 #include <vector>
 
 #include "../platform/test_root.h"
@@ -140,6 +132,7 @@ TEST_F(EseSimTest, LogicalChannelSequenceAsTheDaemonSendsIt) {
   EXPECT_EQ(sel.second.front(), 0x6F);
   EXPECT_EQ(Bytes(sel.second.end() - 2, sel.second.end()), (Bytes{0x90, 0x00}));
   EXPECT_EQ(ipc({0x01, 0x01, 0x00, 0x00, 0x02, 0xCA, 0xFE}), ok({0xCA, 0xFE, 0x90, 0x00}));
+  EXPECT_EQ(trx({0x01, 0x01, 0x00, 0x00}, {0xCA, 0xFE}, 5), ok({0x6C, 0x02}));  // Le reaches the card
   EXPECT_EQ(trx({0x01, 0x70, 0x80, 0x01}, {}, 0), ok({0x90, 0x00}));
   EXPECT_EQ(trx({0x01, 0x70, 0x80, 0x01}, {}, 0), ok({0x68, 0x81}));  // already closed
 
@@ -228,137 +221,6 @@ TEST_F(EseSimTest, OpenAndCloseBesideExchanges) {
   }
   opener.join();
   EXPECT_EQ(phQvEse_init_open(), 0);
-}
-
-// The library's log goes to standard error through its own copy of the log
-// stand-in; while a tap lives, standard error runs into a pipe that the test
-// reads, so it can wait for a line the library writes.
-class StderrTap {
- public:
-  StderrTap() {
-    int fds[2];
-    if (pipe2(fds, O_CLOEXEC) != 0) abort();
-    saved_ = dup(2);
-    dup2(fds[1], 2);
-    close(fds[1]);
-    readFd_ = fds[0];
-    reader_ = std::thread([this] {
-      char buf[1024];
-      ssize_t n;
-      while ((n = read(readFd_, buf, sizeof(buf))) > 0) {
-        std::lock_guard<std::mutex> l(mu_);
-        text_.append(buf, static_cast<size_t>(n));
-        cv_.notify_all();
-      }
-    });
-  }
-  ~StderrTap() {
-    dup2(saved_, 2);  // the pipe's last writer goes: the reader ends
-    close(saved_);
-    reader_.join();
-    close(readFd_);
-  }
-  bool waitFor(const std::string& needle) {
-    std::unique_lock<std::mutex> l(mu_);
-    return cv_.wait_for(l, std::chrono::seconds(20),
-                        [&] { return text_.find(needle) != std::string::npos; });
-  }
-
- private:
-  int saved_ = -1;
-  int readFd_ = -1;
-  std::mutex mu_;
-  std::condition_variable cv_;
-  std::string text_;
-  std::thread reader_;
-};
-
-class EseSimSwitches : public EseSimTest {
- protected:
-  std::string report() {
-    std::ifstream in(root_.at("data/vendor/ese_sim/open_channels"));
-    if (!in) return "(no report)";
-    std::stringstream ss;
-    ss << in.rdbuf();
-    return ss.str();
-  }
-  Bytes manageOpen() {
-    const Reply r = ipc(kManageOpen);
-    EXPECT_TRUE(r.first);
-    return r.second;
-  }
-};
-
-// Channels handed out from a chosen number on, and the report of what is open
-// after each change, the closes from the basic channel included.
-TEST_F(EseSimSwitches, MinimumChannelAndOpenChannelReport) {
-  setProp("channels", "8");
-  setProp("min_channel", "4");
-  ASSERT_EQ(phQvEse_init_open(), 0);
-  EXPECT_EQ(report(), "\n");
-  EXPECT_EQ(manageOpen(), (Bytes{0x04, 0x90, 0x00}));
-  EXPECT_EQ(report(), "4\n");
-  EXPECT_EQ(manageOpen(), (Bytes{0x05, 0x90, 0x00}));
-  EXPECT_EQ(report(), "4 5\n");
-  // The new channel answers through its further-interindustry CLA.
-  const Reply data = ipc({0x41, 0xCA, 0x00, 0x66, 0x00});
-  ASSERT_TRUE(data.first);
-  ASSERT_GE(data.second.size(), 2u);
-  EXPECT_EQ(data.second[data.second.size() - 2], 0x90);
-
-  EXPECT_EQ(trx({0x00, 0x70, 0x80, 0x04}, {}, 0), ok({0x90, 0x00}));
-  EXPECT_EQ(report(), "5\n");
-
-  setProp("min_channel", "7");
-  EXPECT_EQ(manageOpen(), (Bytes{0x07, 0x90, 0x00}));
-  EXPECT_EQ(manageOpen(), (Bytes{0x6A, 0x81}));  // 8 channels: 7 is the last
-  setProp("min_channel", "");
-  EXPECT_EQ(manageOpen(), (Bytes{0x01, 0x90, 0x00}));
-  EXPECT_EQ(report(), "1 5 7\n");
-
-  phQvEse_close();
-  EXPECT_EQ(report(), "\n");
-}
-
-TEST_F(EseSimSwitches, AHungExchangeReturnsOnceThePropertyIsCleared) {
-  ASSERT_EQ(phQvEse_init_open(), 0);
-  struct Case {
-    const char* function;
-    std::function<Bytes()> call;
-  };
-  const Case cases[] = {
-      {"phQVNciHal_Transmit_APDU_by_IPC",
-       [] {
-         const Reply r = ipc({0x00, 0xCA, 0x00, 0x66, 0x00});
-         EXPECT_TRUE(r.first);
-         return r.second.size() < 2 ? r.second : Bytes(r.second.end() - 2, r.second.end());
-       }},
-      {"phQvEse_7816_Transceive",
-       [] {
-         const Reply r = trx({0x00, 0xCA, 0x00, 0x66}, {});
-         EXPECT_TRUE(r.first);
-         return Bytes(r.second.end() - 2, r.second.end());
-       }},
-  };
-  for (const Case& c : cases) {
-    SCOPED_TRACE(c.function);
-    StderrTap tap;
-    setProp("hang_exchange", "1");
-    std::future<Bytes> call;
-    std::future<int32_t> open;
-    // Declared after the calls: on an early return it lets them go first.
-    const std::shared_ptr<void> unhang(nullptr,
-                                       [this](void*) { setProp("hang_exchange", "0"); });
-    call = std::async(std::launch::async, c.call);
-    ASSERT_TRUE(tap.waitFor(std::string(c.function) + ": hanging (vendor.ese_sim.hang_exchange)"));
-    // The library's lock is held: an open waits for the hung call too.
-    open = std::async(std::launch::async, [] { return phQvEse_init_open(); });
-    EXPECT_EQ(call.wait_for(std::chrono::seconds(0)), std::future_status::timeout);
-    setProp("hang_exchange", "0");
-    EXPECT_EQ(call.get(), (Bytes{0x90, 0x00}));
-    EXPECT_EQ(open.get(), 0);
-    EXPECT_TRUE(tap.waitFor(std::string(c.function) + ": released"));
-  }
 }
 
 }  // namespace

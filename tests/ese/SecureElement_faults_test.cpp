@@ -99,41 +99,30 @@ TEST_F(EseFaults, AChannelAboveThreeIsClosedOnTheCardBeforeItIsRefused) {
 // Every operation that takes the lock gives up behind a holder stuck in the
 // library, with its usual failure result, and reaches the library not at all.
 TEST_F(EseFaults, CallersBehindAStuckLibraryCallGiveUpWithTheirFailureResult) {
+  // What an open delivered: result callbacks, channel, status, select response.
+  const auto open = [](const OpenResult& r) {
+    return std::to_string(r.calls) + " " + hex2(r.channel) + " " + std::to_string(int(r.status)) + " [" +
+           fake_ese::hex(r.select) + "]";
+  };
+  const Bytes read = {0x01, 0xB0, 0x00, 0x00, 0x01};
   struct Row {
     const char* op;
-    std::function<void()> run;
+    std::function<std::string()> run;
+    std::string result;
     Calls calls = {"ipc 00 CA 00 00 00", "result"};  // the stuck call, then this one's result
   };
   const Row rows[] = {
-      {"transmit",
-       [this] {
-         const auto r = transmit(se, {0x01, 0xB0, 0x00, 0x00, 0x01});
-         EXPECT_EQ(r.first, 1);
-         EXPECT_EQ(r.second, (Bytes{0x1F}));
-       }},
-      {"openLogicalChannel",
-       [this] {
-         const OpenResult r = openLogical(se, kAid, 0x00);
-         EXPECT_EQ(r.calls, 1);
-         EXPECT_EQ(r.channel, 0x7E);
-         EXPECT_EQ(r.status, Status::FAILED);
-         EXPECT_TRUE(r.select.empty());
-       }},
-      {"openBasicChannel",
-       [this] {
-         const OpenResult r = openBasic(se, kAid, 0x00);
-         EXPECT_EQ(r.calls, 1);
-         EXPECT_EQ(r.status, Status::FAILED);
-         EXPECT_EQ(r.select, (Bytes{0x7E}));
-       }},
-      {"closeChannel", [this] { EXPECT_EQ(se->closeChannel(1), Status::FAILED); }, {"ipc 00 CA 00 00 00"}},
+      {"transmit", [&] { const auto r = transmit(se, read); return std::to_string(r.first) + " " + fake_ese::hex(r.second); }, "1 1F"},
+      {"openLogicalChannel", [&] { return open(openLogical(se, kAid, 0)); }, "1 7E 1 []"},
+      {"openBasicChannel", [&] { return open(openBasic(se, kAid, 0)); }, "1 00 1 [7E]"},
+      {"closeChannel", [&] { return std::to_string(int(Status(se->closeChannel(1)))); }, "1", {"ipc 00 CA 00 00 00"}},
   };
   for (const Row& row : rows) {
     SCOPED_TRACE(row.op);
     fake_ese::reset();
     cap.clear();
     ASSERT_NO_FATAL_FAILURE(startStuckTransmit());
-    row.run();
+    EXPECT_EQ(row.run(), row.result);
     // It came back while the holder is still inside the library.
     EXPECT_FALSE(finishes(holder_, 0));
     EXPECT_EQ(fake_ese::calls(), row.calls);
@@ -143,7 +132,7 @@ TEST_F(EseFaults, CallersBehindAStuckLibraryCallGiveUpWithTheirFailureResult) {
   // Once the library is back, the operations are served again.
   fake_ese::reset();
   fake_ese::queueIpc({0, {0x55, 0x90, 0x00}});
-  EXPECT_EQ(transmit(se, {0x01, 0xB0, 0x00, 0x00, 0x01}).second, (Bytes{0x55, 0x90, 0x00}));
+  EXPECT_EQ(transmit(se, read).second, (Bytes{0x55, 0x90, 0x00}));
 }
 
 // init takes no lock, but its library calls would queue behind the stuck one:

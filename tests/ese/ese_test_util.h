@@ -1,7 +1,6 @@
 #pragma once
-// Shared pieces of the eSE front tests: a recording client, helpers that run
-// one operation and keep what its result callback got (noting "result" in the
-// fake library's call log when it runs), call log lines, the fixture.
+// Shared pieces of the eSE front tests. The helpers that run one operation
+// keep what its result callback got and note "result" in the call log.
 #include <algorithm>
 #include <atomic>
 #include <cstdint>
@@ -48,7 +47,6 @@ struct FakeClient : public ISecureElementHalCallback {
   }
 };
 
-// What one open delivered; `calls` counts the result callbacks.
 struct OpenResult {
   int calls = 0;
   uint8_t channel = 0;
@@ -74,7 +72,6 @@ inline OpenResult openBasic(const sp<SecureElement>& se, const Bytes& aid, uint8
   return r;
 }
 
-// How many times the callback ran, and the response.
 inline std::pair<int, Bytes> transmit(const sp<SecureElement>& se, const Bytes& apdu) {
   std::pair<int, Bytes> r{0, {}};
   se->transmit(apdu, [&](const hidl_vec<uint8_t>& resp) {
@@ -100,8 +97,7 @@ constexpr const char* kPowerOff = "power korva_poweroff";
 
 inline std::string hex2(uint8_t b) { return fake_ese::hex({b}); }
 
-// The call log lines of a SELECT by DF name for kAid, and of MANAGE CHANNEL
-// close for channel c.
+// Call log lines: SELECT by DF name for kAid; MANAGE CHANNEL close of c.
 inline std::string selectLine(uint8_t cla, uint8_t p2) {
   return "trx " + hex2(cla) + " A4 04 " + hex2(p2) + " lc=5 " + fake_ese::hex(kAid) +
          " le_type=1 le=256 rlen=2";
@@ -110,16 +106,14 @@ inline std::string closeLine(uint8_t c) {
   return "trx " + hex2(c) + " 70 80 " + hex2(c) + " lc=0 le_type=0 le=36864 rlen=0";
 }
 
-// Scripts a MANAGE CHANNEL open answered with channel c and a SELECT answered
-// 90 00, so that channel c ends up open and flagged.
+// Scripts channel c opened and selected, so that it ends up flagged.
 inline void scriptOpen(uint8_t c) {
   fake_ese::queueIpc({0, {c, 0x90, 0x00}});
   fake_ese::queueTransceive({0, {}, 0x90, 0x00});
 }
 
 // Which of channels 1..3 are flagged, seen the only way the front shows it:
-// an init whose ready status is 0 closes exactly those, and clears them. The
-// fake library is reset before and after.
+// an init whose ready status is 0 closes exactly those, and clears them.
 inline std::vector<uint8_t> sweepFlags(const sp<SecureElement>& se) {
   fake_ese::reset();
   for (int i = 0; i < 3; ++i) fake_ese::queueTransceive({0, {}, 0x90, 0x00});

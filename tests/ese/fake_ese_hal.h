@@ -1,9 +1,8 @@
 #pragma once
-// A scripted stand-in for the vendor eSE library, linked into test programs in
-// place of libese_qv_hal.so. Each exchange answers from its own queue of
-// scripted replies (a failure when the queue is empty); every call goes to one
-// call log, a line of text each, so that a test compares the whole
-// conversation with the library, its own result callbacks included, at once.
+// A scripted stand-in for the vendor eSE library, linked in place of
+// libese_qv_hal.so. Each exchange answers from its own queue (a failure when
+// empty); every call is one line of one call log, so that a test compares the
+// whole conversation, its own result callbacks included, at once.
 #include <cstdint>
 #include <string>
 #include <vector>

@@ -1,6 +1,7 @@
 // The gate in front of the vendor library, with bounds chosen per test: a
 // bound no test reaches where callers must wait and be served, a bound of
-// nothing where any call in the library counts as stuck.
+// nothing where any call in the library counts as stuck. Giving up on a
+// stuck call and the deferred close are pinned through the front.
 #include <gtest/gtest.h>
 
 #include <pthread.h>
@@ -68,21 +69,6 @@ TEST(LibraryGate, CallersQueuedBehindACallThatReturnsAreAllServedOneAtATime) {
   EXPECT_EQ(gate.waiting(), 0u);
 }
 
-TEST(LibraryGate, CallersGiveUpOnAStuckCallAndComeBackWhenItReturns) {
-  ::android::host::LogCapture cap;
-  LibraryGate gate(kNothing);
-  ASSERT_TRUE(gate.enter("holder"));
-  // One that was waiting and one that arrives later: both give up.
-  auto waiter = std::async(std::launch::async, [&] { return gate.enter("waiter"); });
-  EXPECT_FALSE(waiter.get());
-  EXPECT_FALSE(gate.enter("late"));
-  EXPECT_TRUE(cap.contains("waiter: the eSE library has not returned for", "qvese@1.0-service"));
-  EXPECT_TRUE(cap.contains("late: the eSE library has not returned for", "qvese@1.0-service"));
-  gate.leave();
-  EXPECT_TRUE(gate.enter("after"));
-  gate.leave();
-}
-
 TEST(LibraryGate, TheFrontLockIsWaitedForUnlessItsHolderIsStuckInTheLibrary) {
   LibraryGate gate(kNothing);
   PlainMutex front;
@@ -107,58 +93,6 @@ TEST(LibraryGate, TheFrontLockIsWaitedForUnlessItsHolderIsStuckInTheLibrary) {
   gate.leave();
   pthread_mutex_unlock(front.get());
   EXPECT_EQ(gate.waiting(), 0u);
-}
-
-std::atomic<int> g_actionRuns{0};
-std::atomic<bool> g_actionSawCallerThread{false};
-std::thread::id g_expectedThread;
-void countRun() {
-  ++g_actionRuns;
-  g_actionSawCallerThread = std::this_thread::get_id() == g_expectedThread;
-}
-
-TEST(LibraryGate, ALeftActionRunsOnceOnTheThreadLeavingTheLibrary) {
-  ::android::host::LogCapture cap;
-  LibraryGate gate(minutes(10));
-  g_actionRuns = 0;
-
-  // Free: it runs at once, here.
-  g_expectedThread = std::this_thread::get_id();
-  EXPECT_TRUE(gate.runOrLeave(countRun, "now"));
-  EXPECT_EQ(g_actionRuns.load(), 1);
-  EXPECT_TRUE(g_actionSawCallerThread.load());
-
-  // Busy: it waits for the call in the library, however often it is asked.
-  g_actionRuns = 0;
-  std::promise<void> entered;
-  std::promise<void> letGo;
-  auto inLibrary = std::async(std::launch::async, [&] {
-    g_expectedThread = std::this_thread::get_id();
-    EXPECT_TRUE(gate.enter("holder"));
-    entered.set_value();
-    letGo.get_future().wait();
-    gate.leave();
-  });
-  entered.get_future().wait();
-  EXPECT_FALSE(gate.runOrLeave(countRun, "later"));
-  EXPECT_FALSE(gate.runOrLeave(countRun, "later"));
-  EXPECT_EQ(g_actionRuns.load(), 0);
-
-  // A caller that waits meanwhile comes in only after the action.
-  auto next = std::async(std::launch::async, [&] {
-    const bool in = gate.enter("next");
-    const int runsSeen = g_actionRuns.load();
-    if (in) gate.leave();
-    return in ? runsSeen : -1;
-  });
-  ASSERT_TRUE(waitUntilWaiting(gate, 1));
-  letGo.set_value();
-  inLibrary.get();
-  EXPECT_EQ(g_actionRuns.load(), 1);
-  EXPECT_TRUE(g_actionSawCallerThread.load());
-  EXPECT_EQ(next.get(), 1);
-  EXPECT_TRUE(cap.contains("later: the eSE library is in a call for"));
-  EXPECT_TRUE(cap.contains("later: the deferred library call runs now"));
 }
 
 }  // namespace
