@@ -121,7 +121,8 @@ int32_t at_send_command_singleline(const char* command, const char* responsePref
 int32_t at_send_command_singleline_or_numeric(const char* command, const char* responsePrefix,
                                               ATResponse** pp_outResponse) {
   if (responsePrefix == nullptr) abort();
-  if (g_in->remaining_bytes() > 0 && g_in->ConsumeBool()) {
+  FuzzedDataProvider& in = *fuzz::input();
+  if (in.remaining_bytes() > 0 && in.ConsumeBool()) {
     int32_t err = answer(command, "", pp_outResponse);
     return err;
   }
