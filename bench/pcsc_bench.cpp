@@ -32,37 +32,25 @@
 #include <string>
 #include <vector>
 
+#include "bench_cases.h"
+#include "bench_setup.h"
 #include "bench_util.h"
 #include "card_applets.h"
 
 using ::android::sp;
 using ::android::hardware::hidl_vec;
-using ::android::hardware::Return;
-using ::android::hardware::Void;
 using ::android::hardware::secure_element::V1_0::ISecureElement;
-using ::android::hardware::secure_element::V1_0::ISecureElementHalCallback;
-using ::android::hardware::secure_element::V1_0::LogicalChannelResponse;
-using ::android::hardware::secure_element::V1_0::SecureElementStatus;
 using Bytes = std::vector<uint8_t>;
 using se_bench::nowNanos;
 using se_bench::Stats;
 
 namespace {
 
-std::vector<pid_t> g_children;
-std::string g_root;
-bool g_keep = false;
-
-[[noreturn]] void fail(const std::string& what) {
-  fprintf(stderr, "se-bench-pcsc: %s\n", what.c_str());
-  for (pid_t pid : g_children) {
-    kill(pid, SIGKILL);
-    waitpid(pid, nullptr, 0);
-  }
-  std::error_code ec;
-  if (!g_root.empty() && !g_keep) std::filesystem::remove_all(g_root, ec);
-  _exit(1);
-}
+using se_bench::Case;
+using se_bench::casesFor;
+using se_bench::fail;
+using se_bench::g_children;
+std::string g_root;  // also in se_bench::g_roots, removed on failure
 
 const char kUsage[] =
     "usage: se-bench-pcsc [--bin DIR] [--count N] [--keep]\n"
@@ -158,38 +146,6 @@ int freePortPair() {
   fail("no two free TCP ports in a row");
 }
 
-// Case 2: INS 01 of the echo applet without data, Le 00; answer 90 00.
-// Case 4: 255 bytes echoed back, Le 00; answer the same bytes and 90 00.
-struct Case {
-  const char* name;
-  Bytes command;
-  Bytes response;
-};
-
-std::vector<Case> casesFor(uint8_t channel) {
-  std::vector<Case> cases;
-  cases.push_back({"case-2 (5 B)", {channel, 0x01, 0x00, 0x00, 0x00}, {0x90, 0x00}});
-  Bytes data(255);
-  for (size_t i = 0; i < data.size(); ++i) data[i] = static_cast<uint8_t>(i * 7 + 3);
-  Bytes cmd = {channel, 0x01, 0x00, 0x00, 0xFF};
-  cmd.insert(cmd.end(), data.begin(), data.end());
-  cmd.push_back(0x00);
-  Bytes rsp = data;
-  rsp.push_back(0x90);
-  rsp.push_back(0x00);
-  cases.push_back({"case-4 (261 B)", cmd, rsp});
-  return cases;
-}
-
-class StateCallback : public ISecureElementHalCallback {
- public:
-  Return<void> onStateChange(bool connected) override {
-    state = connected;
-    return Void();
-  }
-  std::optional<bool> state;
-};
-
 // The floor: this process's own PC/SC connection to the same card, shared
 // with the daemon's, on a logical channel of its own.
 class DirectCard {
@@ -255,7 +211,7 @@ int main(int argc, char** argv) {
       count = strtoul(argv[++i], nullptr, 10);
       if (count == 0) fail("--count takes a number >= 1");
     } else if (a == "--keep") {
-      g_keep = true;
+      se_bench::g_keepRoots = true;
     } else if (a == "--help" || a == "-h") {
       fputs(kUsage, stdout);
       return 0;
@@ -267,6 +223,7 @@ int main(int argc, char** argv) {
   char tmpl[] = "/tmp/se-bench-pcsc.XXXXXX";
   if (mkdtemp(tmpl) == nullptr) fail("mkdtemp");
   g_root = tmpl;
+  se_bench::g_roots.push_back(g_root);
   const std::string reader = "Virtual PCD 00 00";
 
   // pcscd, vpcd's reader and the card.
@@ -295,24 +252,8 @@ int main(int argc, char** argv) {
   if (!fileHas(g_root + "/daemon.log", "ese_pcsc: get_korva_exist_flag")) fail("the daemon did not load the PC/SC library");
   setenv("SE_DEVICE_ROOT", g_root.c_str(), 1);
 
-  sp<ISecureElement> ese = ISecureElement::getService("eSE1");
-  if (ese == nullptr) fail("cannot reach eSE1");
-  ::android::host::setCallTimeout(ese, 30000);
-  sp<StateCallback> cb = new StateCallback();
-  if (!ese->init(cb).isOk()) fail("init on eSE1 failed in transport");
-  const int64_t deadline = nowNanos() + 15 * 1000000000LL;
-  while (!cb->state && nowNanos() < deadline) {
-    if (::android::host::pollIncomingCalls(ese, 1000) < 0) fail("connection to eSE1 lost");
-  }
-  if (!cb->state || !*cb->state) fail("eSE1 did not connect to the card; see " + g_root + "/daemon.log");
-  uint8_t eseChannel = 0;
-  SecureElementStatus status = SecureElementStatus::FAILED;
-  ese->openLogicalChannel(se_card::aid::kEcho, 0x00, [&](const LogicalChannelResponse& r, SecureElementStatus s) {
-    eseChannel = r.channelNumber;
-    status = s;
-  });
-  if (status != SecureElementStatus::SUCCESS) fail("cannot open the echo applet on eSE1");
-  const std::vector<Case> eseCases = casesFor(eseChannel);
+  sp<ISecureElement> ese = se_bench::connectInstance("eSE1");
+  const std::vector<Case> eseCases = casesFor(se_bench::openEcho(ese, "eSE1"));
 
   DirectCard direct(reader);
   const std::vector<Case> directCases = casesFor(direct.openEcho());
@@ -376,7 +317,7 @@ int main(int argc, char** argv) {
     ratio[k] = eseTx[k].stats().medianUs / (rpcFloor.stats().medianUs + pcscFloor[k].stats().medianUs);
   }
   printf("| %-52s | %14.2f | %14.2f |\n", "eSE1 through PC/SC / (RPC floor + PC/SC floor)", ratio[0], ratio[1]);
-  if (g_keep) printf("device root kept: %s\n", g_root.c_str());
+  if (se_bench::g_keepRoots) printf("device root kept: %s\n", g_root.c_str());
   fflush(stdout);
 
   ese.clear();
@@ -384,6 +325,6 @@ int main(int argc, char** argv) {
   stop(card);
   if (pcscd > 0) stop(pcscd);
   std::error_code ec;
-  if (!g_keep) std::filesystem::remove_all(g_root, ec);
+  if (!se_bench::g_keepRoots) std::filesystem::remove_all(g_root, ec);
   return 0;
 }
