@@ -172,6 +172,18 @@ TEST_F(EseSimTest, ResponsesStayWithinTheCallersBuffers) {
   // A command longer than any short APDU, and an empty one.
   EXPECT_EQ(ipc(Bytes(5000, 0x00)), ok({0x67, 0x00}));
   EXPECT_EQ(ipc({}), ok({0x67, 0x00}));
+
+  // At the edge, with INS 12 answering N bytes at once: 256 data bytes come
+  // back whole on both routes, one more is refused with nothing handed back.
+  for (const uint16_t n : {256, 257}) {
+    SCOPED_TRACE(n);
+    Bytes want(n);
+    for (size_t i = 0; i < n; ++i) want[i] = static_cast<uint8_t>(i);
+    want.insert(want.end(), {0x90, 0x00});
+    const Bytes cmd = {0x00, 0x12, static_cast<uint8_t>(n >> 8), static_cast<uint8_t>(n & 0xFF)};
+    EXPECT_EQ(ipc(cmd), n <= 256 ? ok(want) : failed());
+    EXPECT_EQ(trx(cmd, {}, 0), n <= 256 ? ok(want) : failed({0x00, 0x00}));
+  }
 }
 
 TEST_F(EseSimTest, MalformedRecordsAreRefused) {
