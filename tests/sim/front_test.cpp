@@ -147,6 +147,49 @@ TEST_F(Front, OpenLogicalChannelResults) {
   EXPECT_FALSE(se_->isChannelOpen(6));  // the refused SELECT left no flag
 }
 
+// The longest answers the request record holds come back whole: 263 bytes
+// of a transmit by +CSIM: or +CGLA:, 262 of a SELECT after the channel byte.
+// One byte more is refused, never cut.
+TEST_F(Front, LongestModemAnswersWholeOneByteMoreRefused) {
+  initAndWait();
+  const auto answer = [](size_t n) {
+    Bytes b(n);
+    for (size_t i = 0; i + 2 < n; i++) b[i] = static_cast<uint8_t>(i);
+    b[n - 2] = 0x90;
+    b[n - 1] = 0x00;
+    return b;
+  };
+  const auto line = [](const std::string& prefix, const Bytes& b) {
+    return okLine(prefix + " " + std::to_string(2 * b.size()) + ",\"" + sim_test::hexOf(b) + "\"");
+  };
+  modem0_->setScript(scriptOf({{"AT+CCHO=", okLine("+CCHO: 257")}, {"AT+CGLA=257,", okLine("+CGLA: 4,\"9000\"")}}));
+  ASSERT_EQ(SecureElementStatus::SUCCESS, open({0xA0, 0x00}, 0x7F).status);
+  struct Row {
+    const char* command;  // what the modem answers, and with which prefix
+    const char* prefix;
+    uint8_t cla;
+    size_t n;
+    bool fits;
+  };
+  const Row transmits[] = {{"AT+CSIM=", "+CSIM:", 0x00, 263, true}, {"AT+CSIM=", "+CSIM:", 0x00, 264, false},
+                           {"AT+CGLA=257,", "+CGLA:", 0x01, 263, true}, {"AT+CGLA=257,", "+CGLA:", 0x01, 264, false}};
+  for (const Row& r : transmits) {
+    SCOPED_TRACE(r.prefix + std::to_string(r.n));
+    modem0_->setScript(scriptOf({{r.command, line(r.prefix, answer(r.n))}}));
+    EXPECT_EQ(r.fits ? answer(r.n) : Bytes{}, transmit({r.cla, 0xB0, 0x00, 0x00}));
+  }
+  const Row selects[] = {{"AT+CGLA=258,", "+CGLA:", 0x00, 262, true}, {"AT+CGLA=258,", "+CGLA:", 0x00, 263, false}};
+  for (const Row& r : selects) {
+    SCOPED_TRACE("select " + std::to_string(r.n));
+    modem0_->setScript(scriptOf({{"AT+CCHO=", okLine("+CCHO: 258")},
+                                 {r.command, line(r.prefix, answer(r.n))},
+                                 {"AT+CCHC=258", finalLine("OK")}}));
+    const OpenResult o = open({0xA0, 0x00}, 0x7F);
+    EXPECT_EQ(r.fits ? SecureElementStatus::SUCCESS : SecureElementStatus::FAILED, o.status);
+    EXPECT_EQ(r.fits ? answer(r.n) : Bytes{}, o.select);
+  }
+}
+
 TEST_F(Front, NewInitClosesChannelsThreeToNineteenOnly) {
   initAndWait();
   for (int session : {0x101, 0x102, 0x103, 0x113}) {
