@@ -133,6 +133,8 @@ int64_t DeviceGate::hangMicros() const {
 
 bool DeviceGate::acquire(const char* op) {
   if (pthread_mutex_trylock(config_.lock) != 0) {
+    GATE_LOG(ANDROID_LOG_DEBUG, "%s, %s busy: waiting (%zu callers)", op, config_.device,
+             callers_.load());
     for (;;) {
       const int64_t bound = hangMicros();
       const int64_t silent = config_.silence();
@@ -283,6 +285,12 @@ void DeviceGate::forgetChannels() {
   for (auto it = queue_.begin(); it != queue_.end();) {
     it = it->channel >= 0 ? queue_.erase(it) : it + 1;
   }
+}
+
+bool DeviceGate::heldByAnother(uint8_t channel, pid_t caller) const {
+  std::lock_guard<std::mutex> g(queueLock_);
+  auto it = owners_.find(channel);
+  return it != owners_.end() && it->second != caller && !processGone(it->second);
 }
 
 void DeviceGate::clientDied(pid_t owner) {

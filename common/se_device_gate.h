@@ -117,6 +117,9 @@ class DeviceGate {
   void forgetChannels();
   // Queues the close of every channel `owner` opened; never waits.
   void clientDied(pid_t owner);
+  // Whether `channel` belongs to a live client other than `caller`: an
+  // init's sweep leaves such a channel alone.
+  bool heldByAnother(uint8_t channel, pid_t caller) const;
 
   // Admitted callers now (tests and logs).
   size_t callers() const { return callers_.load(); }

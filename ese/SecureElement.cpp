@@ -265,10 +265,12 @@ Return<void> SecureElement::init(const sp<ISecureElementHalCallback>& clientCall
     clientCallback->linkToDeath(sp<hidl_death_recipient>(this), 0);
 
     // Channels left open by a client that went away are closed once the eSE
-    // says it is ready; channel 0 is the basic channel and never closed.
+    // says it is ready; channel 0 is the basic channel and never closed, nor
+    // is a channel another client still holds.
+    const pid_t caller = se_call::callerPid();
     if (lib::readyStatus() == 0) {
       for (uint8_t c = 1; c < kTrackedChannels; ++c) {
-        if (g_openedChannels[c].load() == 1 &&
+        if (g_openedChannels[c].load() == 1 && !gate().heldByAnother(c, caller) &&
             closeTracked(c, "internalCloseChannel") == CloseResult::kLibraryFailed) {
           closeLater(c, "init");
         }

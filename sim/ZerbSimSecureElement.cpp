@@ -137,10 +137,14 @@ Return<void> ZerbSimSecureElement::init(const sp<ISecureElementHalCallback>& cli
   // The cookie names the client, so that its death closes its channels.
   (void)clientCallback->linkToDeath(this, static_cast<uint64_t>(se_call::callerPid()));
 
-  // Channels 1 and 2 are left alone: the sweep starts at 3. A close that
-  // cannot be made now is queued by closeChannel and made later.
+  // Channels 1 and 2 are left alone: the sweep starts at 3. So are channels
+  // another client still holds: the sweep is for channels left behind. A
+  // close that cannot be made now is queued by closeChannel and made later.
+  const pid_t caller = se_call::callerPid();
   for (uint8_t channel = 3; channel < SIM_CHANNEL_MAX; channel++) {
-    if (g_simOpenedChannels[channel] != 0) (void)closeChannel(channel);
+    if (g_simOpenedChannels[channel] != 0 && !gate().heldByAnother(channel, caller)) {
+      (void)closeChannel(channel);
+    }
   }
 
   int32_t dualSim = judge_dual_sim();

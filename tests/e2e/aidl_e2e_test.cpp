@@ -334,4 +334,25 @@ TEST_F(AidlEndToEnd, SecliSpeaksAidlWithStatusesByName) {
   EXPECT_NE(err.find(fullName("eSE9")), std::string::npos) << err;
 }
 
+// The basic channel belongs to the client that opened it: another client can
+// neither open it, send on it nor close it; once its client is gone (here one
+// that never called init, so no death notice comes) it is free again.
+TEST_F(AidlEndToEnd, TheBasicChannelBelongsToItsClient) {
+  ASSERT_NO_FATAL_FAILURE(start());
+  const std::string open = std::string("basic ") + kEchoApplet;
+  auto owner = std::make_unique<SecliSession>(root, "eSE1", std::vector<std::string>{"--aidl"});
+  SecliSession other(root, "eSE1", {"--aidl"});
+  ASSERT_EQ(field(other.call("init"), "status"), "SUCCESS");
+  ASSERT_EQ(field(owner->call(open), "status"), "SUCCESS");
+  EXPECT_EQ(field(other.call(open), "status"), "CHANNEL_NOT_AVAILABLE");
+  EXPECT_EQ(field(other.call(echoCommand(0, "A1")), "status"), "CHANNEL_NOT_AVAILABLE");
+  EXPECT_EQ(field(other.call("close 0"), "status"), "FAILED");
+  EXPECT_EQ(field(owner->call(echoCommand(0, "A2")), "response"), "A29000");
+
+  owner->process().stop(SIGKILL);
+  owner.reset();
+  EXPECT_EQ(field(other.call(open), "status"), "SUCCESS");
+  EXPECT_EQ(field(other.call(echoCommand(0, "A3")), "response"), "A39000");
+}
+
 }  // namespace
