@@ -362,7 +362,10 @@ if [ "$two_modems" = 1 ]; then
   step "ATR, now from modem 1" '^atr=3B 88 80 01 4D 4F 44 45 4D 31 AA$' atr "selectmodem=1"
   echo 1 >"$root/sys/nfc/nfc_card_num"
   echo 1 >"$root/sys/nfc/nfc_sim_switch"
-  step "switched back: modem 0 again" '^atr=3B 86' atr "selectmodem=0"
+  # (with --usb-modem, modem 0 has no ATR query: empty)
+  modem0_atr='^atr=3B 86'
+  [ "$usb" = 1 ] && modem0_atr='^atr=\(empty\)$'
+  step "switched back: modem 0 again" "$modem0_atr" atr "selectmodem=0"
 fi
 session_end
 if [ "$usb" = 1 ]; then
