@@ -189,7 +189,7 @@ TEST(ModemHabits, ASim1SessionOnEachKindOfModem) {
 // daemon binds and secli connects relative to the socket's folder. Both
 // instances, HIDL and AIDL; the first secli waits for the AIDL instance of a
 // daemon that has just been started.
-TEST(DeviceRoot, TwoHundredCharactersDeep) {
+TEST(DeepDeviceRoot, TwoHundredCharactersDeep) {
   System sys(200);
   ASSERT_GE(sys.root.path().size(), 200u);
   sys.modem = startModem(sys.root, 0);
