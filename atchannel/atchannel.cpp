@@ -43,6 +43,10 @@ pthread_mutex_t g_attrLock = PTHREAD_MUTEX_INITIALIZER;
 pthread_mutex_t g_registryLock = PTHREAD_MUTEX_INITIALIZER;
 AtContext* g_madeContexts = nullptr;
 
+// at_open calls per modem index over the process's life: a worker that ends
+// and a new one that opens the port again see different numbers.
+std::atomic<uint32_t> g_opens[kModemSlots];
+
 // The context this thread reads for, when it is a reader thread.
 thread_local AtContext* t_readerOf = nullptr;
 // True while the reader runs the unsolicited handler with command_lock held.
@@ -311,6 +315,7 @@ int32_t at_open(int32_t fd, AtUnsolHandler h, int32_t index) {
   }
   AT_LOGD("at_open = ac->fd=%d,ac->index=%d", fd, index);
   ac->unsol_handler = h;
+  ac->open_count = ++g_opens[index];
   {
     MutexGuard g(&ac->command_lock);
     ac->reader_closed = 0;
@@ -520,6 +525,12 @@ int32_t sync_read(int32_t fd, char* dest, int32_t max_len) {
     }
     return static_cast<int32_t>(n);
   }
+}
+
+uint32_t at_open_count(void) {
+  if (!keyReady()) return 0;
+  auto* ac = static_cast<AtContext*>(pthread_getspecific(ac_key));
+  return ac == nullptr ? 0 : ac->open_count;
 }
 
 int32_t at_is_closed(void) {

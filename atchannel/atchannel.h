@@ -60,6 +60,12 @@ int32_t at_get_cme_error(const ATResponse* p_response);
 // Modem index of the calling thread's context, -1 when it has none.
 int32_t get_ac_index(void);
 
+// The number of the port opening the calling thread's port came from (the
+// at_open calls for its modem index, counted over the process; 0 when the
+// thread has no port): what a handler learned about the modem behind the
+// port holds only while this number stays the same. Logs nothing.
+uint32_t at_open_count(void);
+
 // 1 when the calling thread's port is closed (at_close ran, or the reader
 // ended because the port failed, hung up or stayed at end of file) or the
 // thread has no port; 0 while it is usable. Logs nothing.

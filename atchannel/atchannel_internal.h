@@ -75,6 +75,10 @@ struct AtContext {
   // it reads without port_lock: closing `fd` can never hand its number to
   // someone else under a read. Closed by the reader when it ends.
   int32_t reader_fd;
+  // Which at_open of this modem index bound the current port (counted over
+  // the process): a new number means a newly opened port. Written and read
+  // only by the owning thread.
+  uint32_t open_count;
   // Every context ever made, so that records outliving their threads stay
   // reachable (they are never freed). Guarded by the registry's lock.
   AtContext* next_made;

@@ -3,7 +3,7 @@
 #include <fcntl.h>
 #include <poll.h>
 #include <sys/socket.h>
-#include <sys/un.h>
+#include <host/unix_socket.h>
 
 #include <cstdio>
 #include <fstream>
@@ -36,7 +36,7 @@ namespace {
 
 const char kUsage[] =
     "usage: se-bench [--bin DIR] [--lib DIR] [--count N]\n"
-    "                [--startups N] [--daemon-log FILE] [--keep]\n"
+    "                [--startups N] [--daemon-log FILE] [--tmpdir DIR] [--keep]\n"
     "  --bin DIR      folder of qvese@1.0-service, modem-sim, se-bench-select\n"
     "                 (default: this program's folder)\n"
     "  --lib DIR      folder of libese_qv_hal.so (default: DIR/../lib)\n"
@@ -44,6 +44,8 @@ const char kUsage[] =
     "  --startups N   daemon launches timed for start-up (default 7)\n"
     "  --daemon-log F where the measured daemon's log goes (default: daemon.log\n"
     "                 in its device root; /dev/null shows what logging costs)\n"
+    "  --tmpdir DIR   where the temporary device roots are made (default:\n"
+    "                 $TMPDIR, else /tmp); any depth works\n"
     "  --keep         keep the temporary device roots and their logs\n";
 
 std::string selfDir() {
@@ -81,6 +83,8 @@ Options parseOptions(int argc, char** argv) {
       o.startups = static_cast<int>(count(1));
     } else if (a == "--daemon-log") {
       o.daemonLog = value();
+    } else if (a == "--tmpdir") {
+      o.tmpDir = value();
     } else if (a == "--keep") {
       o.keep = true;
     } else if (a == "--help" || a == "-h") {
@@ -92,6 +96,10 @@ Options parseOptions(int argc, char** argv) {
   }
   if (o.binDir.empty()) o.binDir = selfDir();
   if (o.libDir.empty()) o.libDir = o.binDir + "/../lib";
+  if (o.tmpDir.empty()) {
+    const char* env = getenv("TMPDIR");
+    o.tmpDir = env && *env ? env : "/tmp";
+  }
   return o;
 }
 
@@ -134,14 +142,12 @@ Child startModemSim(const Options& o, const std::string& root) {
 
 namespace {
 
+// Reached relative to its folder where the path is long (a deep --tmpdir).
 bool accepts(const std::string& path) {
-  sockaddr_un addr{};
-  addr.sun_family = AF_UNIX;
-  if (path.size() >= sizeof(addr.sun_path)) return false;
-  memcpy(addr.sun_path, path.c_str(), path.size() + 1);
   int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
   if (fd < 0) return false;
-  bool ok = connect(fd, reinterpret_cast<sockaddr*>(&addr), sizeof(addr)) == 0;
+  std::string error;
+  bool ok = android::host::connectUnixAt(fd, path, &error);
   close(fd);
   return ok;
 }

@@ -37,6 +37,7 @@ struct Options {
   int startups = 7;
   bool keep = false;
   std::string daemonLog;  // empty: daemon.log in the device root
+  std::string tmpDir;     // where the temporary device roots go
 };
 
 Options parseOptions(int argc, char** argv);
@@ -47,9 +48,9 @@ void writeFile(const std::string& path, const std::string& text);
 // switched to SIM 1, and the eSE of type 1.
 class DeviceRoot {
  public:
-  explicit DeviceRoot(bool keep) : mKeep(keep) {
-    char tmpl[] = "/tmp/se-bench.XXXXXX";
-    if (mkdtemp(tmpl) == nullptr) fail(std::string("mkdtemp: ") + strerror(errno));
+  DeviceRoot(const std::string& tmpDir, bool keep) : mKeep(keep) {
+    std::string tmpl = tmpDir + "/se-bench.XXXXXX";
+    if (mkdtemp(&tmpl[0]) == nullptr) fail("mkdtemp in " + tmpDir + ": " + strerror(errno));
     mPath = tmpl;
     g_roots.push_back(mPath);
     std::filesystem::create_directories(mPath + "/sys/nfc");

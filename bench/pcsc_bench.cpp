@@ -13,7 +13,6 @@
 #include <poll.h>
 #include <signal.h>
 #include <sys/socket.h>
-#include <sys/un.h>
 #include <sys/utsname.h>
 #include <sys/wait.h>
 #include <unistd.h>
@@ -21,6 +20,7 @@
 
 #include <android/hardware/secure_element/1.0/ISecureElement.h>
 #include <host/rpc_host.h>
+#include <host/unix_socket.h>
 
 #include <algorithm>
 #include <cstring>
@@ -115,11 +115,9 @@ void waitUntil(const std::function<bool()>& ok, int ms, const std::string& what)
 }
 
 bool unixAccepts(const std::string& path) {
-  sockaddr_un addr{};
-  addr.sun_family = AF_UNIX;
-  strncpy(addr.sun_path, path.c_str(), sizeof(addr.sun_path) - 1);
   const int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
-  const bool ok = fd >= 0 && connect(fd, reinterpret_cast<sockaddr*>(&addr), sizeof(addr)) == 0;
+  std::string error;
+  const bool ok = fd >= 0 && android::host::connectUnixAt(fd, path, &error);
   if (fd >= 0) close(fd);
   return ok;
 }

@@ -108,7 +108,7 @@ int main(int argc, char** argv) {
   // Start-up, each launch in a fresh root (registration needs no modem).
   std::vector<int64_t> startups;
   for (int i = 0; i < o.startups; ++i) {
-    DeviceRoot root(false);
+    DeviceRoot root(o.tmpDir, false);
     int64_t t = 0;
     Child d = startDaemon(o, root.path(), &t);
     startups.push_back(t);
@@ -118,8 +118,8 @@ int main(int argc, char** argv) {
   int64_t startupMax = *std::max_element(startups.begin(), startups.end());
 
   // The daemon with its modem, and a second modem for the direct floor.
-  DeviceRoot root(o.keep);
-  DeviceRoot floorRoot(o.keep);
+  DeviceRoot root(o.tmpDir, o.keep);
+  DeviceRoot floorRoot(o.tmpDir, o.keep);
   Child modem = startModemSim(o, root.path());
   Child floorModem = startModemSim(o, floorRoot.path());
   int64_t firstStart = 0;

@@ -31,7 +31,12 @@ std::string finalLine(FuzzedDataProvider& in) {
       static const int kKnown[] = {716, 717, 760, 3, 10};
       return "+CME ERROR: " + std::to_string(kKnown[in.ConsumeIntegralInRange<int>(0, 4)]);
     }
-    case 4: return "+CME ERROR:" + in.ConsumeRandomLengthString(16);
+    case 4: {
+      if (in.ConsumeBool()) return "+CME ERROR:" + in.ConsumeRandomLengthString(16);
+      static const char* const kVerbose[] = {"SIM not inserted", "operation not supported",
+                                             "operation not allowed", "unknown"};
+      return std::string("+CME ERROR: ") + kVerbose[in.ConsumeIntegralInRange<int>(0, 3)];
+    }
     default: return in.ConsumeRandomLengthString(16);
   }
 }
@@ -130,6 +135,10 @@ int32_t at_send_command_singleline_or_numeric(const char* command, const char* r
 }
 
 int32_t get_ac_index(void) { return g_acIndex; }
+// The port opening is chosen per input, so that what one input's handlers
+// learned about a modem is sometimes kept for the next and sometimes not.
+uint32_t g_opening = 1;
+uint32_t at_open_count(void) { return g_opening; }
 
 // The worker's port handling is not reached from the handlers.
 int32_t at_open(int32_t, AtUnsolHandler, int32_t) { abort(); }
@@ -146,6 +155,7 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
   g_sends = 0;
   static const int32_t kIndexes[] = {0, 1, -1};
   g_acIndex = kIndexes[in.ConsumeIntegralInRange<int>(0, 2)];
+  if (in.ConsumeBool()) ++g_opening;
 
   // Session tables as earlier opens may have left them.
   for (auto& table : sessionTable) {

@@ -9,7 +9,17 @@ namespace {
 
 const std::vector<std::string> kError = {"ERROR"};
 
-std::vector<std::string> cme(int code) { return {"+CME ERROR: " + std::to_string(code)}; }
+// The 3GPP TS 27.007 texts of the standard codes; the card errors above 700
+// are vendor codes without one, which a modem in verbose mode reports with
+// the text of 100, "unknown".
+const char* verboseText(int code) {
+  switch (code) {
+    case kCmeNotAllowed: return "operation not allowed";
+    case kCmeNotSupported: return "operation not supported";
+    case kCmeSimNotInserted: return "SIM not inserted";
+    default: return "unknown";
+  }
+}
 
 int hexValue(char c) {
   if (c >= '0' && c <= '9') return c - '0';
@@ -94,6 +104,15 @@ std::string encodeHex(const std::vector<uint8_t>& bytes) {
 AtResponder::AtResponder(const ResponderOptions& options)
     : options_(options), card_(se_card::CardOptions{options.channels, options.atr}) {}
 
+std::vector<std::string> AtResponder::cme(int code) const {
+  switch (options_.errors) {
+    case ResponderOptions::Errors::kBare: return kError;
+    case ResponderOptions::Errors::kVerbose: return {std::string("+CME ERROR: ") + verboseText(code)};
+    case ResponderOptions::Errors::kNumeric: break;
+  }
+  return {"+CME ERROR: " + std::to_string(code)};
+}
+
 int AtResponder::channelOfSession(long session) const {
   if (session <= 0) return -1;
   for (int c = 1; c < se_card::kMaxChannels; ++c) {
@@ -108,6 +127,11 @@ std::vector<std::string> AtResponder::handle(const std::string& line) {
   for (char& c : upper) c = static_cast<char>(toupper(static_cast<unsigned char>(c)));
 
   if (upper == "AT") return {"OK"};
+  if (upper == "AT+CPIN?") {
+    if (options_.cardAbsent) return cme(kCmeSimNotInserted);
+    return {"+CPIN: READY", "OK"};
+  }
+  if (!options_.vendorQueries && (upper == "AT^CARDTYPE?" || upper == "AT^CARDATR")) return kError;
   if (upper == "AT^CARDTYPE?") {
     return {options_.cardAbsent ? "^CARDTYPE: 0,0,0" : "^CARDTYPE: 1,1,0", "OK"};
   }

@@ -23,9 +23,17 @@ struct ResponderOptions {
   // +CGLA:/+CSIM: answers whose length field counts two characters fewer
   // than the text holds (a malformed answer, as some modems send).
   bool shortLength = false;
+  // How error results read: "+CME ERROR: 10" (AT+CMEE=1), "+CME ERROR: SIM
+  // not inserted" (AT+CMEE=2) or a bare "ERROR" (AT+CMEE=0).
+  enum class Errors { kNumeric, kVerbose, kBare } errors = Errors::kNumeric;
+  // AT^CARDTYPE? and AT^CARDATR known; without them both are unknown
+  // commands (ERROR), as on most modems. AT+CPIN? is always answered.
+  bool vendorQueries = true;
 };
 
 // Error codes of "+CME ERROR:" answers.
+constexpr int kCmeNotAllowed = 3;
+constexpr int kCmeNotSupported = 4;
 constexpr int kCmeSimNotInserted = 10;
 constexpr int kCmeNoSuchApplet = 716;
 constexpr int kCmeNoChannel = 717;
@@ -36,7 +44,7 @@ class AtResponder {
   explicit AtResponder(const ResponderOptions& options);
 
   // The lines (without line ends) that answer one command line; the last is
-  // the final result ("OK", "ERROR" or "+CME ERROR: n").
+  // the final result ("OK", "ERROR" or "+CME ERROR: n" / "+CME ERROR: text").
   std::vector<std::string> handle(const std::string& line);
 
   se_card::VirtualCard& card() { return card_; }
@@ -45,6 +53,8 @@ class AtResponder {
   std::vector<std::string> openChannel(const std::vector<uint8_t>& aid, uint8_t p2, const char* prefix);
   std::vector<std::string> exchange(const std::vector<uint8_t>& apdu, const char* prefix);
   int channelOfSession(long session) const;
+  // The error result for `code` in the chosen form.
+  std::vector<std::string> cme(int code) const;
 
   ResponderOptions options_;
   se_card::VirtualCard card_;

@@ -23,15 +23,17 @@ namespace {
 const char kUsage[] =
     "usage: modem-sim --root DIR [options]\n"
     "\n"
-    "Opens a pty pair in raw mode, links DIR/dev/appvcom18 (modem 0) or\n"
-    "DIR/dev/appvcom34 (modem 1) to its slave, prints one ready line and answers\n"
-    "AT commands for a virtual UICC until SIGTERM or SIGINT, then removes the link.\n"
+    "Opens a pty pair (in raw mode unless --tty-defaults), links DIR/dev/appvcom18\n"
+    "(modem 0) or DIR/dev/appvcom34 (modem 1) to its slave, prints one ready line\n"
+    "and answers AT commands for a virtual UICC until SIGTERM or SIGINT, then\n"
+    "removes the link.\n"
     "\n"
-    "Commands: AT, AT^CARDTYPE?, AT^CARDATR, AT+CCHO=\"AID\", AT+CCHP=\"AID\",P2,\n"
-    "AT+CGLA=SESSION,LEN,\"HEX\", AT+CSIM=LEN,\"HEX\", AT+CCHC=SESSION. Anything\n"
-    "else, malformed parameters or a wrong length field: ERROR. Open errors:\n"
-    "+CME ERROR: 716 (no such applet), 717 (no channel free), 760 (card error);\n"
-    "with the card absent every card command gives +CME ERROR: 10.\n"
+    "Commands: AT, AT^CARDTYPE?, AT^CARDATR, AT+CPIN?, AT+CCHO=\"AID\",\n"
+    "AT+CCHP=\"AID\",P2, AT+CGLA=SESSION,LEN,\"HEX\", AT+CSIM=LEN,\"HEX\",\n"
+    "AT+CCHC=SESSION. Anything else, malformed parameters or a wrong length\n"
+    "field: ERROR. Open errors: +CME ERROR: 716 (no such applet), 717 (no channel\n"
+    "free), 760 (card error); with the card absent AT+CPIN? and every card command\n"
+    "give +CME ERROR: 10.\n"
     "Session id of channel c: 256 + c (see --session-base).\n"
     "\n"
     "options:\n"
@@ -50,14 +52,31 @@ const char kUsage[] =
     "  --delay MS          wait MS milliseconds before each answer\n"
     "  --split N           write answers in pieces of N bytes with short pauses\n"
     "  --unsol EVERY       before the final line of every EVERY-th answer, send an\n"
-    "                      unsolicited line (+CREG: 1 and ^RSSI: 20 in turn)\n"
+    "                      unsolicited line (+CREG: 1, ^RSSI: 20, +CGREG: 1,\n"
+    "                      ^MODE: 5,4, RING, +CEREG: 1, +CMTI: \"SM\",3, ^BOOT:... in\n"
+    "                      turn)\n"
     "  --sms-pairs         also send a +CMT: line and its PDU line there (every\n"
     "                      answer unless --unsol gives EVERY)\n"
     "  --silent-on PREFIX  never answer a command starting with PREFIX (any case)\n"
     "  --close-after N     close the port (and remove the link) after N commands\n"
     "  --log FILE          log every line received (\"< ...\") and sent (\"> ...\")\n"
     "                      and events (\"# ...\") to FILE (default stderr)\n"
-    "  --help              this text\n";
+    "  --help              this text\n"
+    "\n"
+    "habits of real modems (a USB modem's AT port, as plugged in):\n"
+    "  --tty-defaults      leave the pty in the kernel's default terminal settings\n"
+    "                      (echo, canonical lines, CR/NL mapping) for the client\n"
+    "                      to set, as a /dev/ttyUSB* or /dev/ttyACM* port is\n"
+    "  --echo              echo each command line before its answer (ATE1), the\n"
+    "                      answer lines framed CR LF ... CR LF\n"
+    "  --errors FORM       error results: numeric (+CME ERROR: 10, AT+CMEE=1; the\n"
+    "                      default), verbose (+CME ERROR: SIM not inserted,\n"
+    "                      AT+CMEE=2; vendor codes read \"unknown\") or bare (ERROR,\n"
+    "                      AT+CMEE=0)\n"
+    "  --no-vendor-queries AT^CARDTYPE? and AT^CARDATR are unknown commands (ERROR);\n"
+    "                      presence only by AT+CPIN?\n"
+    "  --profile usb       all four: --tty-defaults --echo --errors verbose\n"
+    "                      --no-vendor-queries\n";
 
 volatile sig_atomic_t g_stop = 0;
 int g_wakePipe[2] = {-1, -1};
@@ -80,6 +99,8 @@ struct Options {
   std::string silentOn;
   long closeAfter = 0;
   std::string logPath;
+  bool ttyDefaults = false;
+  bool echo = false;
 };
 
 bool parseLong(const char* s, long min, long max, long& out) {
@@ -88,6 +109,20 @@ bool parseLong(const char* s, long min, long max, long& out) {
   long v = strtol(s, &end, 0);
   if (errno != 0 || end == s || *end != '\0' || v < min || v > max) return false;
   out = v;
+  return true;
+}
+
+bool parseErrors(const char* s, modem_sim::ResponderOptions::Errors& out) {
+  using Errors = modem_sim::ResponderOptions::Errors;
+  if (strcmp(s, "numeric") == 0) {
+    out = Errors::kNumeric;
+  } else if (strcmp(s, "verbose") == 0) {
+    out = Errors::kVerbose;
+  } else if (strcmp(s, "bare") == 0) {
+    out = Errors::kBare;
+  } else {
+    return false;
+  }
   return true;
 }
 
@@ -117,6 +152,13 @@ bool writeAll(int fd, const char* p, size_t n) {
   return true;
 }
 
+// What common modems report on their own, in turn: registration, signal,
+// mode and boot reports, a call and a stored SMS.
+const char* const kUnsolicited[] = {"+CREG: 1",    "^RSSI: 20",   "+CGREG: 1",       "^MODE: 5,4",
+                                    "RING",        "+CEREG: 1",   "+CMTI: \"SM\",3",
+                                    "^BOOT:20975085,0,0,0,75"};
+constexpr unsigned kUnsolicitedCount = sizeof(kUnsolicited) / sizeof(kUnsolicited[0]);
+
 class Modem {
  public:
   explicit Modem(const Options& o) : o_(o), responder_(o.responder) {}
@@ -131,10 +173,12 @@ class Modem {
     // daemon closes and reopens the port.
     slave_ = ::open(name, O_RDWR | O_NOCTTY);
     if (slave_ < 0) return fail("open slave");
-    struct termios t;
-    if (tcgetattr(slave_, &t) != 0) return fail("tcgetattr");
-    cfmakeraw(&t);
-    if (tcsetattr(slave_, TCSANOW, &t) != 0) return fail("tcsetattr");
+    if (!o_.ttyDefaults) {
+      struct termios t;
+      if (tcgetattr(slave_, &t) != 0) return fail("tcgetattr");
+      cfmakeraw(&t);
+      if (tcsetattr(slave_, TCSANOW, &t) != 0) return fail("tcsetattr");
+    }
 
     const std::string dev = o_.root + "/dev";
     if (mkdir(dev.c_str(), 0755) != 0 && errno != EEXIST) return fail("mkdir " + dev);
@@ -208,6 +252,13 @@ class Modem {
   void command(const std::string& line) {
     logLine("<", line);
     ++commands_;
+    if (o_.echo) {
+      // The characters as they came, with the CR that ended them.
+      logLine(">", line + " (echo)");
+      if (!writeAll(master_, (line + "\r").data(), line.size() + 1)) {
+        logLine("#", std::string("write failed: ") + strerror(errno));
+      }
+    }
     if (!o_.silentOn.empty() && strncasecmp(line.c_str(), o_.silentOn.c_str(), o_.silentOn.size()) == 0) {
       logLine("#", "silent on this command");
     } else {
@@ -225,7 +276,7 @@ class Modem {
     const long every = o_.unsolEvery > 0 ? o_.unsolEvery : (o_.smsPairs ? 1 : 0);
     if (every > 0 && answers_ % every == 0) {
       std::vector<std::string> extra;
-      if (o_.unsolEvery > 0) extra.push_back((unsolTurn_++ % 2 == 0) ? "+CREG: 1" : "^RSSI: 20");
+      if (o_.unsolEvery > 0) extra.push_back(kUnsolicited[unsolTurn_++ % kUnsolicitedCount]);
       if (o_.smsPairs) {
         extra.push_back("+CMT: ,24");
         extra.push_back("0011000B916407281553F80000AA0BE8329BFD4697D9EC377D");
@@ -236,6 +287,8 @@ class Modem {
     std::string out;
     for (const std::string& l : lines) {
       logLine(">", l);
+      // Verbose result framing (ATV1) as a modem with echo on sends it.
+      if (o_.echo) out += "\r\n";
       out += l;
       out += "\r\n";
     }
@@ -304,7 +357,7 @@ int usageError(const char* msg) {
 int main(int argc, char** argv) {
   enum {
     kRoot = 1000, kModem, kCardAbsent, kAtr, kChannels, kSessionBase, kDelay, kSplit, kUnsol, kSms, kSilent,
-    kCloseAfter, kLog, kHelp, kBareOpen, kShortLength
+    kCloseAfter, kLog, kHelp, kBareOpen, kShortLength, kTtyDefaults, kEcho, kErrors, kNoVendor, kProfile
   };
   static const struct option longOpts[] = {
       {"root", required_argument, nullptr, kRoot},
@@ -322,6 +375,11 @@ int main(int argc, char** argv) {
       {"silent-on", required_argument, nullptr, kSilent},
       {"close-after", required_argument, nullptr, kCloseAfter},
       {"log", required_argument, nullptr, kLog},
+      {"tty-defaults", no_argument, nullptr, kTtyDefaults},
+      {"echo", no_argument, nullptr, kEcho},
+      {"errors", required_argument, nullptr, kErrors},
+      {"no-vendor-queries", no_argument, nullptr, kNoVendor},
+      {"profile", required_argument, nullptr, kProfile},
       {"help", no_argument, nullptr, kHelp},
       {nullptr, 0, nullptr, 0},
   };
@@ -371,6 +429,19 @@ int main(int argc, char** argv) {
         if (!parseLong(optarg, 1, 1L << 40, o.closeAfter)) return usageError("--close-after takes a positive count");
         break;
       case kLog: o.logPath = optarg; break;
+      case kTtyDefaults: o.ttyDefaults = true; break;
+      case kEcho: o.echo = true; break;
+      case kErrors:
+        if (!parseErrors(optarg, o.responder.errors)) return usageError("--errors takes numeric, verbose or bare");
+        break;
+      case kNoVendor: o.responder.vendorQueries = false; break;
+      case kProfile:
+        if (strcmp(optarg, "usb") != 0) return usageError("--profile takes usb");
+        o.ttyDefaults = true;
+        o.echo = true;
+        o.responder.errors = modem_sim::ResponderOptions::Errors::kVerbose;
+        o.responder.vendorQueries = false;
+        break;
       case kHelp: fputs(kUsage, stdout); return 0;
       default: return usageError("unknown option");
     }

@@ -8,7 +8,7 @@ cd "$(dirname "$0")/.."
 
 usage() {
   cat <<'EOF'
-usage: scripts/demo.sh [--two-modems] [--pcsc] [--keep] [--help]
+usage: scripts/demo.sh [--two-modems] [--pcsc] [--usb-modem] [--keep] [--help]
 
 Builds the programs when needed, then in a fresh temporary device root:
 writes the properties and the NFC sysfs nodes, starts modem-sim, starts the
@@ -24,6 +24,10 @@ Every process it starts is stopped at the end.
                 pcscd and the virtual card in vpcd's reader (card-vpcd), and
                 pull the card out and put it back; starts pcscd in the
                 foreground when none runs (as root)
+  --usb-modem   serve "SIM1" from a modem that behaves as a USB modem does
+                when plugged in (modem-sim --profile usb): its tty in the
+                kernel's default settings, command echo, verbose errors, no
+                vendor queries (presence by AT+CPIN?, no ATR)
   --keep        keep the device root (logs, properties) and print its path
   --help        this text
 
@@ -33,11 +37,13 @@ EOF
 
 two_modems=0
 pcsc=0
+usb=0
 keep=0
 for a in "$@"; do
   case "$a" in
     --two-modems) two_modems=1 ;;
     --pcsc) pcsc=1 ;;
+    --usb-modem) usb=1 ;;
     --keep) keep=1 ;;
     -h | --help) usage; exit 0 ;;
     *) echo "demo: unknown option '$a'" >&2; usage >&2; exit 2 ;;
@@ -197,10 +203,13 @@ echo 0 >"$root/sys/nfc/nfc_wired_ese_type"
 echo "Secure element service demo"
 echo "device root: $root"
 echo
-"${pd[@]}" "$bin/modem-sim" --root "$root" --modem 0 --log "$root/modem0.log" >"$root/modem0.out" 2>&1 &
+modem0_args=()
+[ "$usb" = 1 ] && modem0_args=(--profile usb)
+"${pd[@]}" "$bin/modem-sim" --root "$root" --modem 0 "${modem0_args[@]}" --log "$root/modem0.log" \
+  >"$root/modem0.out" 2>&1 &
 pids+=($!)
 wait_for "$root/modem0.out" "ready" || exit 1
-echo "modem-sim:   modem 0 on $root/dev/appvcom18 (log: modem0.log)"
+echo "modem-sim:   modem 0 on $root/dev/appvcom18 ${modem0_args[*]} (log: modem0.log)"
 if [ "$two_modems" = 1 ]; then
   "${pd[@]}" "$bin/modem-sim" --root "$root" --modem 1 --atr 3B8880014D4F44454D31AA --log "$root/modem1.log" \
     >"$root/modem1.out" 2>&1 &
@@ -302,12 +311,29 @@ session_end
 
 # ---- SIM1 ---------------------------------------------------------------------------
 echo
-echo "== SIM1: the SIM card, through AT commands to modem-sim =="
-session_start SIM1
-step "init: the worker for the modem starts, the port is opened" '^state=true$' init \
-  "init_at_channel"
-step "is a card there?" '^present=true$' present "CARDTYPE" "CARDTYPE"
-step "ATR" '^atr=3B' atr "" "CARDATR"
+missing='^NO_SUCH_ELEMENT_ERROR'
+if [ "$usb" = 1 ]; then
+  echo "== SIM1: the SIM card, through AT commands to modem-sim --profile usb =="
+  echo "   (a USB modem as plugged in: a tty in the kernel's default settings, command"
+  echo "   echo, verbose errors, no AT^CARDTYPE? / AT^CARDATR)"
+  session_start SIM1
+  step "init: the worker opens the port, a terminal, and puts it in raw mode" '^state=true$' init \
+    "raw mode set"
+  step "is a card there? AT^CARDTYPE? is unknown to this modem, AT+CPIN? answers" '^present=true$' \
+    present "does not know AT\^CARDTYPE" "^< AT\+CPIN"
+  step "again: straight to AT+CPIN? (learned for this port)" '^present=true$' present "" "^< AT"
+  step "ATR: the modem has no ATR query, the ATR is empty" '^atr=\(empty\)$' atr \
+    "does not know AT\^CARDATR"
+  # Verbose errors carry no code: a refused open is a plain failure.
+  missing='^FAILED'
+else
+  echo "== SIM1: the SIM card, through AT commands to modem-sim =="
+  session_start SIM1
+  step "init: the worker for the modem starts, the port is opened" '^state=true$' init \
+    "init_at_channel"
+  step "is a card there?" '^present=true$' present "CARDTYPE" "CARDTYPE"
+  step "ATR" '^atr=3B' atr "" "CARDATR"
+fi
 step "open a logical channel to the echo applet" \
   '^SUCCESS channel=[0-9]+ select=6F' "open $ECHO" "AT\+CCHP" "AT\+CCHP"
 e=$(channel)
@@ -323,7 +349,7 @@ step "32 bytes left for GET RESPONSE: 61 20, fetched by secli on channel $b" \
   '^00 01 02 03 .* 1E 1F 90 00' "transmit $(cla_of "$b") 11 00 20 00"
 step "close the echo channel" '^SUCCESS$' "close $e" "" "^< AT\+CCHC"
 step "close the other one" '^SUCCESS$' "close $b"
-step "an applet the card does not have" '^NO_SUCH_ELEMENT_ERROR' "open $NONE" "" "CME ERROR"
+step "an applet the card does not have" "$missing" "open $NONE" "" "CME ERROR"
 step "the basic channel: SIM1 refuses it, CHANNEL_NOT_AVAILABLE is the right answer" \
   '^CHANNEL_NOT_AVAILABLE' "basic $ECHO" "openBasicChannel"
 step "APDUs on the basic channel itself still go through, by AT+CSIM" '^9F 7F .*90 00' \
@@ -336,9 +362,27 @@ if [ "$two_modems" = 1 ]; then
   step "ATR, now from modem 1" '^atr=3B 88 80 01 4D 4F 44 45 4D 31 AA$' atr "selectmodem=1"
   echo 1 >"$root/sys/nfc/nfc_card_num"
   echo 1 >"$root/sys/nfc/nfc_sim_switch"
-  step "switched back: modem 0 again" '^atr=3B 86' atr "selectmodem=0"
+  # (with --usb-modem, modem 0 has no ATR query: empty)
+  modem0_atr='^atr=3B 86'
+  [ "$usb" = 1 ] && modem0_atr='^atr=\(empty\)$'
+  step "switched back: modem 0 again" "$modem0_atr" atr "selectmodem=0"
 fi
 session_end
+if [ "$usb" = 1 ]; then
+  # With its tty left cooked, the modem would get its own answers back as
+  # commands: every line it received must be one of the daemon's.
+  steps=$((steps + 1))
+  received=$(grep -c '^< ' "$root/modem0.log")
+  stray=$(grep '^< ' "$root/modem0.log" | grep -vc '^< AT')
+  printf '\n  # what the modem received: %s lines, %s of them not an AT command from the daemon\n' \
+    "$received" "$stray"
+  if [ "$stray" -eq 0 ] && [ "$received" -gt 0 ]; then
+    printf '    as expected\n'
+  else
+    printf '    NOT AS EXPECTED\n'
+    failed=$((failed + 1))
+  fi
+fi
 
 # ---- eSE1 over AIDL -------------------------------------------------------------------
 echo

@@ -1,11 +1,13 @@
 #!/usr/bin/env bash
 # Installs the Debian packages the build needs, when any is missing.
-#   scripts/deps.sh        compilers, CMake, GoogleTest, xmllint (device files
-#                          check), and PC/SC: pcscd, its client library and
-#                          the vpcd reader driver
+#   scripts/deps.sh        compilers, CMake, GoogleTest, xmllint and bpfmt
+#                          (device files check: blueprint-tools is Android.bp's
+#                          parser and formatter), and PC/SC: pcscd, its client
+#                          library and the vpcd reader driver
 #   scripts/deps.sh fuzz   also clang and its runtimes (libFuzzer, sanitizers)
 set -euo pipefail
-pkgs=(cmake make g++ libgtest-dev libgmock-dev libxml2-utils pcscd libpcsclite-dev vsmartcard-vpcd)
+pkgs=(cmake make g++ libgtest-dev libgmock-dev libxml2-utils blueprint-tools pcscd libpcsclite-dev
+  vsmartcard-vpcd)
 command -v pkg-config >/dev/null || pkgs+=(pkg-config)
 if [ "${1:-}" = fuzz ]; then
   pkgs+=(clang libclang-rt-14-dev)

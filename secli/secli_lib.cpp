@@ -101,8 +101,17 @@ int runMain(const std::vector<std::string>& args, FILE* out, FILE* err, FILE* in
   std::function<Result(const Command&)> runCommand;
   std::unique_ptr<Session> session;
   std::unique_ptr<AidlSession> aidlSession;
+  // With --wait, an instance not there yet is looked for again until it is
+  // or the time is up, as list --wait does.
+  const auto waitEnd = std::chrono::steady_clock::now() + std::chrono::milliseconds(o.waitMs);
+  auto keepLooking = [&] {
+    if (std::chrono::steady_clock::now() >= waitEnd) return false;
+    std::this_thread::sleep_for(std::chrono::milliseconds(50));
+    return true;
+  };
   if (o.aidl) {
     aidlSession = AidlSession::connect(o.instance, o.timeoutMs);
+    while (aidlSession == nullptr && keepLooking()) aidlSession = AidlSession::connect(o.instance, o.timeoutMs);
     if (aidlSession == nullptr) {
       fprintf(err, "secli: no AIDL instance %s (%s)\n", o.instance.c_str(),
               ::android::host::aidlSocketPath(aidlInstanceName(o.instance)).c_str());
@@ -113,6 +122,7 @@ int runMain(const std::vector<std::string>& args, FILE* out, FILE* err, FILE* in
     runCommand = [&](const Command& c) { return aidlSession->run(c); };
   } else {
     sp<ISecureElement> se = ISecureElement::getService(o.instance);
+    while (se == nullptr && keepLooking()) se = ISecureElement::getService(o.instance);
     if (se == nullptr) {
       fprintf(err, "secli: no instance %s (%s)\n", o.instance.c_str(),
               ::android::host::serviceSocketPath(o.instance).c_str());

@@ -137,6 +137,7 @@ struct Options {
   std::string script;        // -f FILE ("-": standard input)
   bool list = false;         // the list command
   int listWaitMs = -1;       // list --wait SECONDS
+  int waitMs = 0;            // --wait SECONDS: for the instance to be registered
   std::vector<std::string> command;  // COMMAND [ARG...]
 };
 

@@ -244,6 +244,8 @@ std::string mainHelp() {
       "  -i NAME            the instance, e.g. SIM1 or eSE1 (see 'list')\n"
       "  --aidl             speak the AIDL interface to the instance (the same\n"
       "                     name): errors come back as statuses by name\n"
+      "  --wait SECONDS     wait up to SECONDS for the instance to be registered\n"
+      "                     (a daemon just started registers HIDL, then AIDL)\n"
       "  -f FILE            run the commands of FILE (- for standard input), one a\n"
       "                     line, '#' starts a comment; all on one connection\n"
       "  --chain            transmit follows 61xx with GET RESPONSE on the same\n"
@@ -342,6 +344,12 @@ ArgsOutcome parseArgs(const std::vector<std::string>& args, Options* out, std::s
         return ArgsOutcome::Usage;
       }
       o.root = v;
+    } else if (a == "--wait") {
+      if (!value(a, &v)) return ArgsOutcome::Usage;
+      if (!parseSeconds(v, true, &o.waitMs)) {
+        *message = "--wait '" + v + "' is not a number of seconds";
+        return ArgsOutcome::Usage;
+      }
     } else if (a == "--timeout") {
       if (!value(a, &v)) return ArgsOutcome::Usage;
       if (!parseSeconds(v, false, &o.timeoutMs)) {

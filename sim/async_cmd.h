@@ -85,6 +85,10 @@ void asyncCmdStop(int32_t modem_id);
 // controlling terminal); a descriptor or -1. Its own unit, so that tests can
 // watch the worker's open attempts.
 int asyncCmdOpenPort(const char* path);
+// Puts an opened port that is a terminal (a USB modem's tty) in raw mode and
+// logs it: 1 when done, 0 for a port that is no terminal (left as it is),
+// -1 when the settings could not be changed (logged; the port stays open).
+int asyncCmdRawTerminal(int fd, const char* path);
 // How long the command in flight on either modem has waited without a line
 // of its answer, in microseconds; 0 when none waits.
 int64_t asyncCmdSilenceMicros(void);

@@ -4,6 +4,8 @@
 #include <at_tok.h>
 #include <securec.h>
 
+#include <strings.h>
+
 #include <cstring>
 
 #include "async_cmd.h"
@@ -153,54 +155,191 @@ void clear_session_table(int32_t modem_id) {
   for (int32_t& session : sessionTable[modem_id]) session = 0;
 }
 
+// ---- card presence and ATR ------------------------------------------------
+//
+// Not every modem knows the vendor queries AT^CARDTYPE? and AT^CARDATR. One
+// that answers them as an unknown command is asked the standard AT+CPIN?
+// for presence instead, and gives no ATR. What a port's modem lacks is
+// learned once per port opening: a port opened again may be another modem.
+
+namespace {
+
+enum class Support { kUnknown, kYes, kNo };
+
+struct ModemQueries {
+  uint32_t opening = 0;  // at_open_count() of the port this was learned on
+  Support cardType = Support::kUnknown;
+  Support cardAtr = Support::kUnknown;
+};
+
+// One per modem; each is touched only by that modem's worker.
+ModemQueries g_queries[ASYNC_CMD_MODEM_MAX];
+
+ModemQueries& queriesOfThisPort() {
+  static ModemQueries unused;  // a modem id out of range learns nothing lasting
+  const int32_t m = g_asyncCmd.modem_id;
+  ModemQueries& q = (m >= 0 && m < ASYNC_CMD_MODEM_MAX) ? g_queries[m] : unused;
+  const uint32_t opening = at_open_count();
+  if (q.opening != opening) q = ModemQueries{opening, Support::kUnknown, Support::kUnknown};
+  return q;
+}
+
+// The text after "+CME ERROR:" when it is not a number (AT+CMEE=2), else null.
+const char* verboseCmeText(const char* final) {
+  static const char kCme[] = "+CME ERROR:";
+  if (final == nullptr || strncmp(final, kCme, sizeof(kCme) - 1) != 0) return nullptr;
+  const char* text = final + sizeof(kCme) - 1;
+  while (*text == ' ') ++text;
+  return (*text >= '0' && *text <= '9') ? nullptr : text;
+}
+
+// The 3GPP TS 27.007 error an answer carries, numeric or verbose; -1 for
+// none that is known here.
+int32_t cmeCode(const ATResponse* response) {
+  const int32_t numeric = at_get_cme_error(response);
+  if (numeric > 0) return numeric;
+  const char* text = verboseCmeText(response ? response->final_response : nullptr);
+  if (text == nullptr) return -1;
+  static const struct {
+    int32_t code;
+    const char* text;
+  } kVerbose[] = {{3, "operation not allowed"}, {4, "operation not supported"}, {10, "SIM not inserted"}};
+  for (const auto& v : kVerbose) {
+    if (strcasecmp(text, v.text) == 0) return v.code;
+  }
+  return -1;
+}
+
+bool bareError(const ATResponse* response) {
+  return response != nullptr && response->final_response != nullptr &&
+         strcmp(response->final_response, "ERROR") == 0;
+}
+
+// The modem answered, and its answer says it does not know the command: a
+// bare ERROR (AT+CMEE=0, or how most modems answer an unknown command),
+// COMMAND NOT SUPPORT, or the errors 3 and 4 in either form.
+bool refusedAsUnknown(int32_t err, const ATResponse* response) {
+  if (err < 0 || response == nullptr || response->success != 0) return false;
+  if (bareError(response)) return true;
+  const char* final = response->final_response;
+  if (final != nullptr && strncmp(final, "COMMAND NOT SUPPORT", 19) == 0) return true;
+  const int32_t code = cmeCode(response);
+  return code == 3 || code == 4;
+}
+
+const char* finalText(const ATResponse* response) {
+  return (response && response->final_response) ? response->final_response : "(none)";
+}
+
+// Presence by AT^CARDTYPE?: 1 or 0, or -1 when the modem does not know the
+// query (learned for this port).
+int32_t presenceByCardType(ModemQueries& q) {
+  static const char* const kFn = "request_get_card_present";
+  ResponseHolder response;
+  int32_t err = at_send_command_singleline("AT^CARDTYPE?", "^CARDTYPE:", response.out());
+  if (!exchangeOk(err, response.get())) {
+    if (refusedAsUnknown(err, response.get())) {
+      q.cardType = Support::kNo;
+      QV_LOGI("%s, the modem does not know AT^CARDTYPE? (%s): presence from AT+CPIN? on this port",
+              kFn, finalText(response.get()));
+      return -1;
+    }
+    // Any other final answer (no card, say) comes from a modem that knows it.
+    if (err >= 0 && response.get() != nullptr && response.get()->final_response != nullptr) {
+      q.cardType = Support::kYes;
+    }
+    return 0;
+  }
+  q.cardType = Support::kYes;
+  char* line = response.get()->p_intermediates->text;
+  int32_t cardmode = 0;
+  int32_t hasC = 0;
+  int32_t hasG = 0;
+  if (at_tok_start(&line) < 0) {
+    QV_LOGE("%s: %s\n", kFn, "at_tok_start(&line) failed");
+  } else if (at_tok_nextint(&line, &cardmode) < 0) {
+    QV_LOGE("%s: %s\n", kFn, "at_tok_nextint cardmode failed");
+  } else if (at_tok_nextint(&line, &hasC) < 0) {
+    QV_LOGE("%s: %s\n", kFn, "at_tok_nextint has_c failed");
+  } else if (at_tok_nextint(&line, &hasG) < 0) {
+    QV_LOGE("%s: %s\n", kFn, "at_tok_nextint has_g failed");
+  } else {
+    // A 32-bit sum that wraps as the modem's own arithmetic does, without
+    // the undefined overflow of a signed addition.
+    int32_t sum = static_cast<int32_t>(static_cast<uint32_t>(hasC) + static_cast<uint32_t>(hasG));
+    return (cardmode >= 1 && sum > 0) ? 1 : 0;
+  }
+  return 0;
+}
+
+// Presence by AT+CPIN? (3GPP TS 27.007): any +CPIN: answer (READY, SIM PIN,
+// SIM PUK, ...) means a card is there; error 10, "SIM not inserted", means
+// none; any other failure counts as none too.
+int32_t presenceByPin() {
+  static const char* const kFn = "request_get_card_present";
+  ResponseHolder response;
+  int32_t err = at_send_command_singleline("AT+CPIN?", "+CPIN:", response.out());
+  if (exchangeOk(err, response.get())) return 1;
+  if (err >= 0 && cmeCode(response.get()) == 10) return 0;
+  QV_LOGE("%s, AT+CPIN? failed (err %d, %s): card counted as absent", kFn, err,
+          finalText(response.get()));
+  return 0;
+}
+
+}  // namespace
+
 void request_get_card_present(void) {
   static const char* const kFn = "request_get_card_present";
   QV_LOGD("%s, enter, g_ulModemId: %d", kFn, static_cast<int32_t>(g_ulModemId));
-  int32_t present = 0;
-  ResponseHolder response;
-  int32_t err = at_send_command_singleline("AT^CARDTYPE?", "^CARDTYPE:", response.out());
-  if (exchangeOk(err, response.get())) {
-    char* line = response.get()->p_intermediates->text;
-    int32_t cardmode = 0;
-    int32_t hasC = 0;
-    int32_t hasG = 0;
-    if (at_tok_start(&line) < 0) {
-      QV_LOGE("%s: %s\n", kFn, "at_tok_start(&line) failed");
-    } else if (at_tok_nextint(&line, &cardmode) < 0) {
-      QV_LOGE("%s: %s\n", kFn, "at_tok_nextint cardmode failed");
-    } else if (at_tok_nextint(&line, &hasC) < 0) {
-      QV_LOGE("%s: %s\n", kFn, "at_tok_nextint has_c failed");
-    } else if (at_tok_nextint(&line, &hasG) < 0) {
-      QV_LOGE("%s: %s\n", kFn, "at_tok_nextint has_g failed");
-    } else {
-      // A 32-bit sum that wraps as the modem's own arithmetic does, without
-      // the undefined overflow of a signed addition.
-      int32_t sum = static_cast<int32_t>(static_cast<uint32_t>(hasC) + static_cast<uint32_t>(hasG));
-      present = (cardmode >= 1 && sum > 0) ? 1 : 0;
-    }
-  }
+  ModemQueries& q = queriesOfThisPort();
+  int32_t present = q.cardType == Support::kNo ? -1 : presenceByCardType(q);
+  if (present < 0) present = presenceByPin();
   g_asyncCmd.param = present;
 }
+
+namespace {
+
+// Whether the modem knows AT^CARDATR, judged from an answer that failed. A
+// bare ERROR may also mean that no card is there: it counts as "unknown
+// command" only on a modem that lacks the other vendor query too.
+bool atrQueryUnknown(ModemQueries& q, int32_t err, const ATResponse* response) {
+  if (!refusedAsUnknown(err, response)) return false;
+  if (!bareError(response)) return true;
+  if (q.cardType == Support::kUnknown) (void)presenceByCardType(q);
+  return q.cardType == Support::kNo;
+}
+
+}  // namespace
 
 void request_get_atr(void) {
   static const char* const kFn = "request_get_atr";
   QV_LOGD("%s, enter, g_ulModemId: %d", kFn, static_cast<int32_t>(g_ulModemId));
+  ModemQueries& q = queriesOfThisPort();
   ResponseHolder response;
   const char* cardatr = nullptr;
-  int32_t err = at_send_command_singleline("AT^CARDATR", "^CARDATR:", response.out());
-  if (!exchangeOk(err, response.get())) {
-    logExchangeFailure(kFn, err, response.get());
-  } else {
-    char* line = response.get()->p_intermediates->text;
-    char* text = nullptr;
-    if (at_tok_start(&line) < 0) {
-      QV_LOGE("%s: %s\n", kFn, "at_tok_start(&line) failed");
-    } else if (at_tok_nextstr(&line, &text) < 0) {
-      QV_LOGE("%s: %s\n", kFn, "at_tok_nextstr(&line, &p_cardatr) failed");
-    } else if (text == nullptr) {
-      QV_LOGE("%s, p_cardatr is NULL", kFn);
+  if (q.cardAtr != Support::kNo) {
+    int32_t err = at_send_command_singleline("AT^CARDATR", "^CARDATR:", response.out());
+    if (!exchangeOk(err, response.get())) {
+      if (atrQueryUnknown(q, err, response.get())) {
+        q.cardAtr = Support::kNo;
+        QV_LOGI("%s, the modem does not know AT^CARDATR (%s) and has no other ATR query: "
+                "getAtr gives an empty ATR on this port", kFn, finalText(response.get()));
+      } else {
+        logExchangeFailure(kFn, err, response.get());
+      }
     } else {
-      cardatr = text;
+      q.cardAtr = Support::kYes;
+      char* line = response.get()->p_intermediates->text;
+      char* text = nullptr;
+      if (at_tok_start(&line) < 0) {
+        QV_LOGE("%s: %s\n", kFn, "at_tok_start(&line) failed");
+      } else if (at_tok_nextstr(&line, &text) < 0) {
+        QV_LOGE("%s: %s\n", kFn, "at_tok_nextstr(&line, &p_cardatr) failed");
+      } else if (text == nullptr) {
+        QV_LOGE("%s, p_cardatr is NULL", kFn);
+      } else {
+        cardatr = text;
+      }
     }
   }
   size_t n = cardatr ? strlen(cardatr) : 0;

@@ -1,5 +1,6 @@
 #include "rpc_io.h"
 
+#include <host/unix_socket.h>
 #include <poll.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
@@ -83,14 +84,6 @@ bool validServiceName(const std::string& name) {
   return true;
 }
 
-bool fillAddress(const std::string& path, sockaddr_un* addr) {
-  memset(addr, 0, sizeof(*addr));
-  addr->sun_family = AF_UNIX;
-  if (path.size() >= sizeof(addr->sun_path)) return false;
-  memcpy(addr->sun_path, path.c_str(), path.size() + 1);
-  return true;
-}
-
 bool makeDirs(const std::string& dir) {
   // Parents as usual; the socket folder itself private to the daemon's user.
   for (size_t pos = 1; pos <= dir.size(); ++pos) {
@@ -105,26 +98,13 @@ bool makeDirs(const std::string& dir) {
 }
 
 int connectTo(const std::string& path, std::string* error) {
-  sockaddr_un addr;
-  if (!fillAddress(path, &addr)) {
-    if (error) *error = "socket path too long";
-    return -1;
-  }
-  int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
-  if (fd < 0) {
+  UniqueFd fd(socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
+  if (fd.get() < 0) {
     if (error) *error = strerror(errno);
     return -1;
   }
-  int r;
-  do {
-    r = connect(fd, reinterpret_cast<sockaddr*>(&addr), sizeof(addr));
-  } while (r != 0 && errno == EINTR);
-  if (r != 0) {
-    if (error) *error = strerror(errno);
-    close(fd);
-    return -1;
-  }
-  return fd;
+  if (!connectUnixAt(fd.get(), path, error)) return -1;
+  return fd.release();
 }
 
 }  // namespace rpc

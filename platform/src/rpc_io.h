@@ -83,8 +83,6 @@ struct DeathLink {
 
 bool validServiceName(const std::string& name);
 
-bool fillAddress(const std::string& path, sockaddr_un* addr);
-
 bool makeDirs(const std::string& dir);
 
 // A connected socket to `path`, or -1 with the reason in *error.

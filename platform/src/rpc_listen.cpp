@@ -4,6 +4,7 @@
 
 #include <host/device_root.h>
 #include <host/rpc_host.h>
+#include <host/unix_socket.h>
 
 #include <dirent.h>
 #include <sys/socket.h>
@@ -26,11 +27,6 @@ status_t Host::add(const std::string& dir, const std::string& name,
     return BAD_VALUE;
   }
   std::string path = dir + "/" + name;
-  sockaddr_un addr;
-  if (!fillAddress(path, &addr)) {
-    RPC_LOGE("cannot register %s: socket path too long", path.c_str());
-    return BAD_VALUE;
-  }
   std::lock_guard<std::mutex> g(mLock);
   for (auto& l : mListeners) {
     if (l->path == path) {
@@ -53,8 +49,12 @@ status_t Host::add(const std::string& dir, const std::string& name,
     unlink(path.c_str());  // left behind by an earlier run
   }
   UniqueFd fd(socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0));
-  if (fd.get() < 0 || bind(fd.get(), reinterpret_cast<sockaddr*>(&addr), sizeof(addr)) != 0 ||
-      chmod(path.c_str(), 0600) != 0 || listen(fd.get(), 64) != 0) {
+  std::string why;
+  if (fd.get() >= 0 && !bindUnixAt(fd.get(), path, &why)) {
+    RPC_LOGE("cannot register %s: %s", name.c_str(), why.c_str());
+    return UNKNOWN_ERROR;
+  }
+  if (fd.get() < 0 || chmod(path.c_str(), 0600) != 0 || listen(fd.get(), 64) != 0) {
     RPC_LOGE("cannot listen on %s: %s", path.c_str(), strerror(errno));
     return UNKNOWN_ERROR;
   }

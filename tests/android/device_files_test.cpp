@@ -2,7 +2,8 @@
 // daemon target builds and nothing of the host's; the init script starts the
 // binary Android.bp installs; the VINTF fragment declares exactly the
 // instances the daemon registers; SELinux labels the binary and the devices
-// the daemon opens with types its policy declares; the XML is well formed.
+// the daemon opens with types its policy declares; the XML is well formed
+// and Android.bp is as bpfmt parses and formats it.
 #include <gtest/gtest.h>
 
 #include <sys/wait.h>
@@ -169,18 +170,31 @@ TEST(DeviceFiles, TheManifestDeclaresTheInstancesTheDaemonRegisters) {
   EXPECT_EQ(sorted(declared), sorted(registeredNames()));
 }
 
-TEST(DeviceFiles, TheXmlIsWellFormed) {
-  const std::string cmd = "xmllint --noout '" + std::string(SE_SOURCE_DIR) + "/" +
-                          bpList("vintf_fragments").at(0) + "' 2>&1";
+// Runs `tool args` on a source file; its exit status (127: not installed)
+// and everything it printed.
+int runTool(const std::string& tool, const std::string& args, const std::string& rel, std::string* out) {
+  const std::string cmd = tool + " " + args + " '" + std::string(SE_SOURCE_DIR) + "/" + rel + "' 2>&1";
   FILE* p = popen(cmd.c_str(), "r");
-  ASSERT_NE(p, nullptr);
-  std::string out;
+  if (p == nullptr) return -1;
   char buf[256];
-  while (fgets(buf, sizeof(buf), p)) out += buf;
+  while (fgets(buf, sizeof(buf), p)) *out += buf;
   const int status = pclose(p);
-  ASSERT_TRUE(WIFEXITED(status));
-  ASSERT_NE(WEXITSTATUS(status), 127) << "xmllint is missing (scripts/deps.sh installs it)";
-  EXPECT_EQ(WEXITSTATUS(status), 0) << out;
+  return WIFEXITED(status) ? WEXITSTATUS(status) : -1;
+}
+
+// Checked by the field's own tools: the manifest by xmllint, Android.bp by
+// bpfmt (Debian's blueprint-tools), which parses it as Soong does and shows
+// any difference from its formatting.
+TEST(DeviceFiles, TheXmlIsWellFormedAndAndroidBpParsesAsFormatted) {
+  std::string out;
+  int status = runTool("xmllint", "--noout", bpList("vintf_fragments").at(0), &out);
+  ASSERT_NE(status, 127) << "xmllint is missing (scripts/deps.sh installs it)";
+  EXPECT_EQ(status, 0) << out;
+  out.clear();
+  status = runTool("bpfmt", "-d", "Android.bp", &out);
+  ASSERT_NE(status, 127) << "bpfmt is missing (scripts/deps.sh installs blueprint-tools)";
+  EXPECT_EQ(status, 0) << out;
+  EXPECT_EQ(out, "") << "bpfmt would format Android.bp differently";
 }
 
 TEST(DeviceFiles, SelinuxLabelsTheBinaryAndTheDaemonsDevicesWithDeclaredTypes) {

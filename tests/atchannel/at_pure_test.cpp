@@ -206,6 +206,17 @@ TEST(LineSorting, Table) {
       {"+CREG: 1", 1, at_type_singleline, 0, "^CARDTYPE:", AT_KIND_UNSOLICITED},
       {"^CARDTYPE:", 1, at_type_singleline, 0, "^CARDTYPE:", AT_KIND_INTERMEDIATE},
       {"^CARDTYP", 1, at_type_singleline, 0, "^CARDTYPE:", AT_KIND_UNSOLICITED},
+      // Real modems: the echoed command (ATE1) is never its own answer, the
+      // verbose error form (AT+CMEE=2) ends a command, and the unsolicited
+      // reports of common modems between an answer's lines stay unsolicited.
+      {"AT+CGLA=257,10,\"0001000001\"", 1, at_type_singleline, 0, "+CGLA:", AT_KIND_UNSOLICITED},
+      {"AT+CCHO=\"A00000000101\"", 1, at_type_singleline_or_numeric, 0, "+CCHO:", AT_KIND_UNSOLICITED},
+      {"AT+CPIN?", 1, at_type_singleline, 0, "+CPIN:", AT_KIND_UNSOLICITED},
+      {"+CME ERROR: SIM not inserted", 1, at_type_singleline, 0, "+CPIN:", AT_KIND_FINAL_ERROR},
+      {"+CPIN: SIM PIN", 1, at_type_singleline, 0, "+CPIN:", AT_KIND_INTERMEDIATE},
+      {"RING", 1, at_type_singleline_or_numeric, 0, "+CCHO:", AT_KIND_UNSOLICITED},
+      {"^BOOT:20975085,0,0,0,75", 1, at_type_singleline, 1, "+CGLA:", AT_KIND_UNSOLICITED},
+      {"+CMTI: \"SM\",3", 1, at_type_singleline, 0, "+CSIM:", AT_KIND_UNSOLICITED},
   };
   for (const Case& c : cases) {
     EXPECT_EQ(at_classify_line(c.line, c.pending, c.type, c.hasIntermediate, c.prefix), c.want)

@@ -5,7 +5,10 @@
 
 #include <signal.h>
 
+#include <regex>
+#include <sstream>
 #include <string>
+#include <vector>
 
 #include "se_harness.h"
 
@@ -101,17 +104,140 @@ TEST_F(EndToEnd, WithoutAnEseOnlySim1IsServed) {
   EXPECT_EQ(field(sim.call("present"), "present"), "true");
 }
 
-// Where the socket cannot be made, the first registration fails and the
-// daemon ends with status 1.
+// The commands in a log, each cut at its '=' (the daemon's log masks what
+// follows): what the daemon logged as sent, or what the modem received.
+std::vector<std::string> commandHeads(const std::string& log, const std::regex& line) {
+  std::vector<std::string> heads;
+  std::istringstream in(log);
+  std::smatch m;
+  for (std::string l; std::getline(in, l);) {
+    if (std::regex_search(l, m, line)) heads.push_back(m[1].str().substr(0, m[1].str().find('=')));
+  }
+  return heads;
+}
+
+// A SIM1 session on a modem with one of real modems' habits, and with all of
+// them at once (a USB modem as plugged in): a port left in the kernel's
+// default terminal settings, which the daemon must make raw or the modem
+// gets its own answers back as commands; command echo; verbose and bare
+// errors (a refused open then carries no code); unsolicited lines inside
+// answers; no vendor queries (presence by AT+CPIN?, no ATR, learned once).
+TEST(ModemHabits, ASim1SessionOnEachKindOfModem) {
+  struct Habit {
+    std::vector<std::string> args;
+    bool vendorQueries, numericErrors, card;
+  };
+  const Habit habits[] = {
+      {{"--tty-defaults"}, true, true, true},
+      {{"--echo"}, true, true, true},
+      {{"--errors", "verbose"}, true, false, true},
+      {{"--errors", "bare"}, true, false, true},
+      {{"--unsol", "1"}, true, true, true},
+      {{"--no-vendor-queries"}, false, true, true},
+      {{"--profile", "usb"}, false, false, true},
+      {{"--profile", "usb", "--errors", "bare", "--unsol", "1"}, false, false, true},
+      {{"--profile", "usb", "--card-absent"}, false, false, false},
+      {{"--no-vendor-queries", "--errors", "bare", "--card-absent"}, false, false, false},
+  };
+  const std::regex sent("atchannel: m0_[0-9]+>(AT.*)");
+  const std::regex received("^< (.*)");
+  for (const Habit& h : habits) {
+    std::string name;
+    for (const std::string& a : h.args) name += a + " ";
+    SCOPED_TRACE(name);
+    System sys;
+    sys.modem = startModem(sys.root, 0, h.args);
+    sys.daemon = startDaemon(sys.root);
+    {
+      SecliSession s(sys.root, "SIM1");
+      EXPECT_EQ(field(s.call("init"), "state"), "true");
+      // The second round asks what the first one learned about the modem.
+      for (int round = 0; round < 2; ++round) {
+        EXPECT_EQ(field(s.call("present"), "present"), h.card ? "true" : "false");
+        EXPECT_EQ(field(s.call("atr"), "atr"), h.card && h.vendorQueries ? "3B86800153452D53494D6B" : "");
+      }
+      if (!h.card) {
+        EXPECT_EQ(field(s.call(std::string("open ") + kEchoApplet), "status"), "FAILED");
+      } else {
+        const int channel = openEcho(s);
+        EXPECT_EQ(channel, 1);
+        EXPECT_EQ(echo(s, channel, "5A"), "5A9000");
+        EXPECT_EQ(field(s.call("transmit 00 CA 00 66"), "response"), "66067304060201019000");
+        EXPECT_EQ(field(s.call("open A000000001FF"), "status"),
+                  h.numericErrors ? "NO_SUCH_ELEMENT_ERROR" : "FAILED");
+        EXPECT_EQ(field(s.call("close " + std::to_string(channel)), "status"), "SUCCESS");
+        EXPECT_EQ(echo(s, channel, "5A"), "");
+      }
+    }
+    // Both logs complete: the daemon first, so that no port is in use when
+    // the modem goes.
+    sys.daemon->stop(SIGKILL);
+    sys.modem->stop(SIGTERM);
+    const std::string daemonLog = sys.daemon->err().text();
+    const std::string modemLog = sys.modem->err().text();
+    EXPECT_NE(daemonLog.find("asyncCmdRawTerminal, /dev/appvcom18 is a terminal: raw mode set"),
+              std::string::npos);
+    // Nothing reached the modem but the daemon's commands.
+    const std::vector<std::string> heads = commandHeads(modemLog, received);
+    EXPECT_EQ(heads, commandHeads(daemonLog, sent));
+    EXPECT_GE(heads.size(), h.card ? 9u : 4u);
+    EXPECT_EQ(countOf(modemLog, "< AT^CARDTYPE?"), h.vendorQueries ? 2u : 1u);
+    EXPECT_EQ(countOf(modemLog, "< AT^CARDATR"), h.vendorQueries ? 2u : 1u);
+    EXPECT_EQ(countOf(modemLog, "< AT+CPIN?"), h.vendorQueries ? 0u : 2u);
+  }
+}
+
+// A device root of 200 characters, as a user's build or temporary folder may
+// be: every socket path is longer than a Unix socket address holds, so the
+// daemon binds and secli connects relative to the socket's folder. Both
+// instances, HIDL and AIDL; the first secli waits for the AIDL instance of a
+// daemon that has just been started.
+TEST(DeepDeviceRoot, TwoHundredCharactersDeep) {
+  System sys(200);
+  ASSERT_GE(sys.root.path().size(), 200u);
+  sys.modem = startModem(sys.root, 0);
+  sys.daemon = std::make_unique<Process>(std::vector<std::string>{kDaemon}, sys.root.path());
+  std::string out;
+  EXPECT_EQ(secli(sys.root, {"--aidl", "--wait", "20", "-i", "SIM1", "present"}, &out), 0);
+  EXPECT_EQ(out, "SUCCESS present=false\n");  // no init yet: the modem port is not open
+  EXPECT_EQ(secli(sys.root, {"list"}, &out), 0);
+  EXPECT_EQ(out,
+            "SIM1\neSE1\nandroid.hardware.secure_element.ISecureElement/SIM1\n"
+            "android.hardware.secure_element.ISecureElement/eSE1\n");
+  for (const char* instance : {"eSE1", "SIM1"}) {
+    for (bool aidl : {false, true}) {
+      SCOPED_TRACE(std::string(instance) + (aidl ? " AIDL" : " HIDL"));
+      SecliSession s(sys.root, instance, aidl ? std::vector<std::string>{"--aidl"} : std::vector<std::string>{});
+      EXPECT_EQ(field(s.call("init"), "state"), "true");
+      const int channel = openEcho(s);
+      EXPECT_EQ(echo(s, channel, "C3"), "C39000");
+      EXPECT_EQ(field(s.call("close " + std::to_string(channel)), "status"), "SUCCESS");
+    }
+  }
+}
+
+// Where the socket cannot be made (a file in the way of its folder, a device
+// root so deep that the folder's path exceeds what the system takes), the
+// first registration fails with a line naming the path and the daemon ends
+// with status 1.
 TEST_F(EndToEnd, AFailedRegistrationEndsTheDaemon) {
-  for (const auto& c : {std::make_pair("1", "SecureElement Registered eSE1 fail"),
-                        std::make_pair("0", "ZerbSimSecureElement Registered sim1 fail")}) {
-    TempRoot r;
-    r.write("dev/socket", "a file where the socket folder should be\n");
-    r.property(std::string("vendor.ese_sim.type=") + c.first);
+  const struct {
+    size_t rootLength;
+    const char* eseType;
+    const char* says;
+  } cases[] = {
+      {0, "1", "SecureElement Registered eSE1 fail"},
+      {0, "0", "ZerbSimSecureElement Registered sim1 fail"},
+      {4080, "1", "/dev/socket/secure_element: File name too long"},
+  };
+  for (const auto& c : cases) {
+    SCOPED_TRACE(c.says);
+    TempRoot r(c.rootLength);
+    if (c.rootLength == 0) r.write("dev/socket", "a file where the socket folder should be\n");
+    r.property(std::string("vendor.ese_sim.type=") + c.eseType);
     Process d({kDaemon}, r.path());
     EXPECT_EQ(d.waitExit(), 1) << d.err().text();
-    EXPECT_NE(d.err().text().find(c.second), std::string::npos) << d.err().text();
+    EXPECT_NE(d.err().text().find(c.says), std::string::npos) << d.err().text();
     expectNoSanitizerReport("daemon", d.err().text());
   }
 }

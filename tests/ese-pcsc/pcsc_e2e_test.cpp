@@ -41,7 +41,9 @@ class PcscEndToEnd : public ::testing::Test {
     argv.insert(argv.end(), env_.begin(), env_.end());
     argv.push_back(kDaemon);
     daemon = std::make_unique<Process>(argv, root.path());
-    ASSERT_TRUE(daemon->err().waitFor("ZerbSimSecureElement Registered sim1 success")) << daemon->err().text();
+    ASSERT_TRUE(daemon->err().waitFor(
+        "AIDL Registered android.hardware.secure_element.ISecureElement/SIM1 success"))
+        << daemon->err().text();
     // The PC/SC library, not the simulated one, answered for the eSE type.
     ASSERT_TRUE(daemon->err().waitFor("ese_pcsc: get_korva_exist_flag: 1")) << daemon->err().text();
   }

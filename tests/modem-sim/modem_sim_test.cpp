@@ -5,6 +5,7 @@
 #include <poll.h>
 #include <signal.h>
 #include <sys/stat.h>
+#include <termios.h>
 #include <unistd.h>
 
 #include <fstream>
@@ -20,7 +21,8 @@ using Lines = std::vector<std::string>;
 constexpr int kTimeoutMs = 5000;
 
 // modem-sim in a fresh device root, logging to a file, its port opened as
-// the daemon would open it once the ready line is out.
+// the daemon would open it once the ready line is out: a terminal put in
+// raw mode.
 class Sim {
  public:
   explicit Sim(std::vector<std::string> args, int modem = 0)
@@ -34,20 +36,30 @@ class Sim {
   bool openPort() {
     closePort();
     fd_ = open(port_.c_str(), O_RDWR | O_NOCTTY);
-    return fd_ >= 0;
+    struct termios t;
+    if (fd_ < 0 || tcgetattr(fd_, &t) != 0) return false;
+    echoedAtOpen_ = (t.c_lflag & ECHO) != 0;
+    canonicalAtOpen_ = (t.c_lflag & ICANON) != 0;
+    cfmakeraw(&t);
+    return tcsetattr(fd_, TCSANOW, &t) == 0;
   }
+  // The terminal settings the port had before this client set them.
+  bool echoedAtOpen() const { return echoedAtOpen_; }
+  bool canonicalAtOpen() const { return canonicalAtOpen_; }
   void closePort() {
     if (fd_ >= 0) close(fd_);
     fd_ = -1;
   }
   void send(const std::string& bytes) { ASSERT_EQ(write(fd_, bytes.data(), bytes.size()), (ssize_t)bytes.size()); }
-  // Next line (CR LF ended); "" on time-out or hang-up.
+  // Next line (ended by CR or LF, empty ones skipped); "" on time-out or
+  // hang-up.
   std::string line() {
     for (;;) {
-      const size_t end = buf_.find("\r\n");
+      buf_.erase(0, buf_.find_first_not_of("\r\n"));
+      const size_t end = buf_.find_first_of("\r\n");
       if (end != std::string::npos) {
         std::string l = buf_.substr(0, end);
-        buf_.erase(0, end + 2);
+        buf_.erase(0, end + 1);
         return l;
       }
       pollfd p = {fd_, POLLIN, 0};
@@ -93,6 +105,8 @@ class Sim {
   std::string port_, buf_, ready_;
   se_test::Process proc_;
   int fd_ = -1;
+  bool echoedAtOpen_ = false;
+  bool canonicalAtOpen_ = false;
 };
 
 TEST(ModemSimTest, AnswersTheCardCommands) {
@@ -169,6 +183,22 @@ TEST(ModemSimTest, Options) {
         {"AT+CCHP=\"A00000000103\",4", {"258", "OK"}},
         {"AT+CCHO=\"A000000001FF\"", {"+CME ERROR: 716"}},
         {"AT+CGLA=257,12,\"000100000155\"", {"+CGLA: 6,\"559000\"", "OK"}}}},
+      // Real modems' habits: error forms, no vendor queries, command echo.
+      {{"--errors", "verbose", "--card-absent"}, 0,
+       {{"AT+CPIN?", {"+CME ERROR: SIM not inserted"}},
+        {"AT^CARDATR", {"+CME ERROR: SIM not inserted"}}}},
+      {{"--errors", "verbose"}, 0,
+       {{"AT+CPIN?", {"+CPIN: READY", "OK"}}, {"AT+CCHO=\"A000000001FF\"", {"+CME ERROR: unknown"}}}},
+      {{"--errors", "bare", "--card-absent"}, 0,
+       {{"AT+CPIN?", {"ERROR"}}, {"AT+CCHO=\"A00000000101\"", {"ERROR"}}}},
+      {{"--no-vendor-queries"}, 0,
+       {{"AT^CARDTYPE?", {"ERROR"}}, {"AT^CARDATR", {"ERROR"}}, {"AT+CPIN?", {"+CPIN: READY", "OK"}}}},
+      {{"--echo"}, 0,
+       {{"AT", {"AT", "OK"}}, {"AT^CARDTYPE?", {"AT^CARDTYPE?", "^CARDTYPE: 1,1,0", "OK"}}}},
+      {{"--profile", "usb"}, 0,
+       {{"AT^CARDTYPE?", {"AT^CARDTYPE?", "ERROR"}},
+        {"AT+CPIN?", {"AT+CPIN?", "+CPIN: READY", "OK"}},
+        {"AT+CCHO=\"A000000001FF\"", {"AT+CCHO=\"A000000001FF\"", "+CME ERROR: unknown"}}}},
       {{"--short-length"}, 0,
        {{"AT+CCHO=\"A00000000101\"", {"+CCHO: 257", "OK"}},
         {"AT+CGLA=257,12,\"000100000155\"", {"+CGLA: 4,\"559000\"", "OK"}},
@@ -176,9 +206,13 @@ TEST(ModemSimTest, Options) {
         {"AT+CSIM=10,\"0020000001\"", {"+CSIM: 2,\"6D00\"", "OK"}}}},
   };
   for (const Case& c : cases) {
-    SCOPED_TRACE(c.options[0]);
+    SCOPED_TRACE(c.options[0] + " " + c.options.back());
     Sim sim(c.options, c.modem);
     EXPECT_EQ(sim.ready().rfind("modem-sim: modem " + std::to_string(c.modem) + " ready on ", 0), 0u);
+    // Only a modem left as plugged in hands its client a cooked terminal.
+    const bool cooked = c.options[0] == "--profile";
+    EXPECT_EQ(sim.echoedAtOpen(), cooked);
+    EXPECT_EQ(sim.canonicalAtOpen(), cooked);
     for (const auto& [cmd, expect] : c.exchanges) {
       if (expect.empty()) {
         sim.send(cmd + "\r");
@@ -226,13 +260,14 @@ TEST(ModemSimTest, ClosesThePortAfterNCommands) {
 
 TEST(ModemSimTest, HelpAndBadOptions) {
   const std::pair<std::vector<std::string>, int> rows[] = {
-      {{"--help"}, 0}, {{"--modem", "2"}, 2}, {{"--atr", "3B0"}, 2}, {{"--bogus"}, 2}};
+      {{"--help"}, 0}, {{"--modem", "2"}, 2}, {{"--atr", "3B0"}, 2}, {{"--bogus"}, 2},
+      {{"--errors", "loud"}, 2}, {{"--profile", "pcie"}, 2}};
   for (const auto& [args, code] : rows) {
     std::vector<std::string> argv{MODEM_SIM_PATH};
     argv.insert(argv.end(), args.begin(), args.end());
     se_test::Process p(argv, "/");
     EXPECT_EQ(p.waitExit(), code) << args[0];
-    for (const char* o : {"--silent-on", "--bare-open", "--short-length"})
+    for (const char* o : {"--silent-on", "--bare-open", "--short-length", "--tty-defaults", "--profile usb"})
       EXPECT_EQ(p.out().text().find(o) != std::string::npos, code == 0) << o;
   }
 }

@@ -1,10 +1,13 @@
-// Properties file rules and the device-root path mapping.
+// Properties file rules, the device-root path mapping, and Unix socket
+// paths as long as a deep device root makes them.
 #include <gtest/gtest.h>
 
 #include <cutils/properties.h>
 #include <host/device_root.h>
+#include <host/unix_socket.h>
 
 #include <fcntl.h>
+#include <sys/socket.h>
 #include <unistd.h>
 
 #include <cstring>
@@ -104,6 +107,51 @@ TEST(DeviceRoot, OpenResolvesUnderTheRoot) {
   EXPECT_STREQ(buf, "AT");
   close(fd);
   EXPECT_LT(open("/dev/no-such-node", O_RDONLY), 0);
+}
+
+// A socket whose path is longer than an address holds is bound and reached
+// through its folder, in a program whose open() maps absolute paths under a
+// device root; a name too long even for that is refused with a sentence that
+// names the path.
+TEST(UnixSocketAt, PathsOfAnyLengthAndNamesThatCannotBe) {
+  se_test::TestRoot root;
+  std::string dir = root.path();
+  while (dir.size() < 250) dir += "/" + std::string(40, 's');
+  std::filesystem::create_directories(dir);
+  const struct {
+    std::string path;
+    bool works;
+    const char* why;
+  } cases[] = {
+      {root.at("short"), true, ""},
+      {dir + "/SIM1", true, ""},
+      {dir + "/" + std::string(100, 'n'), false, "is too long for a Unix socket address"},
+      {dir + "/missing/SIM1", false, "cannot open its folder"},
+  };
+  for (const auto& c : cases) {
+    SCOPED_TRACE(c.path.substr(c.path.rfind('/')));
+    std::string error;
+    const int server = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+    const int client = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+    const bool bound = android::host::bindUnixAt(server, c.path, &error) && listen(server, 1) == 0;
+    EXPECT_EQ(bound, c.works) << error;
+    if (!c.works) {
+      EXPECT_NE(error.find(c.path), std::string::npos) << error;
+      EXPECT_NE(error.find(c.why), std::string::npos) << error;
+    }
+    EXPECT_EQ(android::host::connectUnixAt(client, c.path, &error), c.works) << error;
+    if (c.works) {
+      const int accepted = accept(server, nullptr, nullptr);
+      EXPECT_GE(accepted, 0);
+      EXPECT_EQ(write(client, "x", 1), 1);
+      char b = 0;
+      EXPECT_EQ(read(accepted, &b, 1), 1);
+      EXPECT_EQ(b, 'x');
+      close(accepted);
+    }
+    close(client);
+    close(server);
+  }
 }
 
 }  // namespace

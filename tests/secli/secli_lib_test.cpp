@@ -125,6 +125,7 @@ TEST(SecliParse, ArgumentsAndHelpOnEveryLevel) {
       {{"-i", "SIM1", "-f", "x", "present"}, ArgsOutcome::Usage, "either"},
       {{"--timeout", "0", "-i", "SIM1", "present"}, ArgsOutcome::Usage, "--timeout"},
       {{"--timeout", "soon", "-i", "SIM1", "present"}, ArgsOutcome::Usage, "--timeout"},
+      {{"--wait", "-1", "-i", "SIM1", "present"}, ArgsOutcome::Usage, "--wait"},
       {{"--bogus", "list"}, ArgsOutcome::Usage, "unknown option"},
       {{"-i"}, ArgsOutcome::Usage, "needs a value"},
       {{"list", "--wait"}, ArgsOutcome::Usage, "list [--wait"},
@@ -149,9 +150,11 @@ TEST(SecliParse, ArgumentsAndHelpOnEveryLevel) {
   EXPECT_EQ(o.instance, "eSE1");
   EXPECT_EQ(o.script, "s.txt");
   EXPECT_FALSE(o.chain || o.trace || o.aidl);
-  ASSERT_EQ(parseArgs({"--aidl", "--chain", "--trace", "-i", "eSE1", "present"}, &o, &message),
+  ASSERT_EQ(parseArgs({"--aidl", "--chain", "--trace", "--wait", "1.5", "-i", "eSE1", "present"}, &o,
+                      &message),
             ArgsOutcome::Run);
   EXPECT_TRUE(o.chain && o.trace && o.aidl);
+  EXPECT_EQ(o.waitMs, 1500);
   ASSERT_EQ(parseArgs({"list", "--wait", "3"}, &o, &message), ArgsOutcome::Run);
   EXPECT_TRUE(o.list);
   EXPECT_EQ(o.listWaitMs, 3000);

@@ -148,12 +148,21 @@ TEST_F(SecliProcessTest, KillingSecliMidScriptMakesTheServerSeeServiceDied) {
   EXPECT_EQ(se->watcher->cookies(), std::vector<uint64_t>{0});
 }
 
+// list, and --wait for an instance that is not there yet: given up after the
+// time asked for, or served once it comes.
 TEST_F(SecliProcessTest, ListShowsRegisteredInstances) {
   Outcome o = run({"list", "--wait", "0.1"});
   EXPECT_EQ(o.status, 1);
   EXPECT_EQ(o.out, "");
   EXPECT_EQ(lineCount(o.err), 1u);
+  o = run({"--wait", "0.1", "-i", "SIM1", "present"});
+  EXPECT_EQ(o.status, 1);
+  EXPECT_NE(o.err.find("secli: no instance SIM1"), std::string::npos) << o.err;
+  Process waiting(argv({"--wait", "20", "-i", "SIM1", "present"}), root.path());
+  waiting.closeStdin();
   start();
+  EXPECT_EQ(waiting.waitExit(), 0) << waiting.err().text();
+  EXPECT_EQ(waiting.out().text(), "present=true\n");
   o = run({"list"});
   EXPECT_EQ(o.status, 0);
   EXPECT_EQ(o.out, "SIM1\n");

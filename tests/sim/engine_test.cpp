@@ -191,11 +191,87 @@ TEST_F(Engine, Atr) {
               {okLine("^CARDATR: 3b9f"), 0, 2, {0x3B, 0x9F}, nullptr},
               {okLine("^CARDATR: \"\""), 1, 0, {}, nullptr},
               {okLine("^CARDATR: \"3B0\""), 0, -1, {}, nullptr},
-              {finalLine("ERROR"), 1, 0, {}, "request_get_atr:cmd return errno="},
+              {finalLine("+CME ERROR: 10"), 1, 0, {}, "request_get_atr:cmd return errno="},
               {okLine("^CARDATR"), 1, 0, {}, "request_get_atr:cmd return errno=-6"},
               {okLine("^CARDATR: \"" + atr263 + "\""), 0, 263, std::vector<uint8_t>(263, 0xAA), nullptr},
               // One byte more than the data area holds is refused, never cut.
               {okLine("^CARDATR: \"" + atr263 + "BB\""), 1, 0, {}, "request_get_atr, atr of 528 hex digits"}});
+}
+
+// A modem without the vendor queries: presence by AT+CPIN?, no ATR. Each
+// row runs on a freshly opened port; `again` is what a second request of the
+// same kind sends once the first has learned the modem's answer.
+TEST_F(Engine, PresenceAndAtrOnAModemWithoutTheVendorQueries) {
+  const std::string cpinReady = okLine("+CPIN: READY");
+  struct Case {
+    int32_t request;
+    Replies replies;
+    int32_t param;
+    std::vector<std::string> first, again;
+    const char* log;
+  };
+  const std::vector<std::string> presenceProbe = {"AT^CARDTYPE?", "AT+CPIN?"};
+  const std::vector<std::string> pinOnly = {"AT+CPIN?"};
+  const Case cases[] = {
+      // Unknown command, in each form a modem uses; AT+CPIN? answers.
+      {REQUEST_GET_CARD_PRESENT, {{"AT+CPIN?", cpinReady}}, 1, presenceProbe, pinOnly,
+       "the modem does not know AT^CARDTYPE? (ERROR)"},
+      {REQUEST_GET_CARD_PRESENT, {{"AT^", finalLine("+CME ERROR: 4")}, {"AT+CPIN?", okLine("+CPIN: SIM PIN")}},
+       1, presenceProbe, pinOnly, "(+CME ERROR: 4)"},
+      {REQUEST_GET_CARD_PRESENT,
+       {{"AT^", finalLine("+CME ERROR: operation not supported")}, {"AT+CPIN?", cpinReady}}, 1,
+       presenceProbe, pinOnly, nullptr},
+      {REQUEST_GET_CARD_PRESENT, {{"AT^", finalLine("COMMAND NOT SUPPORT")}, {"AT+CPIN?", cpinReady}}, 1,
+       presenceProbe, pinOnly, nullptr},
+      // No card, numeric or verbose; any other failure counts as none too.
+      {REQUEST_GET_CARD_PRESENT, {{"AT+CPIN?", finalLine("+CME ERROR: 10")}}, 0, presenceProbe, pinOnly,
+       nullptr},
+      {REQUEST_GET_CARD_PRESENT, {{"AT+CPIN?", finalLine("+CME ERROR: SIM not inserted")}}, 0,
+       presenceProbe, pinOnly, nullptr},
+      {REQUEST_GET_CARD_PRESENT, {}, 0, presenceProbe, pinOnly, "AT+CPIN? failed (err 0, ERROR)"},
+      // A modem that knows the query and says no card: no fallback, asked again.
+      {REQUEST_GET_CARD_PRESENT, {{"AT^CARDTYPE?", finalLine("+CME ERROR: 10")}}, 0, {"AT^CARDTYPE?"},
+       {"AT^CARDTYPE?"}, nullptr},
+      // No ATR query: an empty ATR, not asked again. A bare ERROR is taken
+      // for that only where the presence query is unknown as well.
+      {REQUEST_GET_ATR, {}, 1, {"AT^CARDATR", "AT^CARDTYPE?"}, {},
+       "the modem does not know AT^CARDATR (ERROR) and has no other ATR query"},
+      {REQUEST_GET_ATR, {{"AT^CARDATR", finalLine("+CME ERROR: 4")}}, 1, {"AT^CARDATR"}, {}, nullptr},
+      {REQUEST_GET_ATR, {{"AT^CARDTYPE?", okLine("^CARDTYPE: 0,0,0")}}, 1, {"AT^CARDATR", "AT^CARDTYPE?"},
+       {"AT^CARDATR"}, "request_get_atr:cmd return errno=0"},
+  };
+  for (const Case& c : cases) {
+    SCOPED_TRACE(::testing::Message() << c.request << " " << (c.replies.empty() ? "" : c.replies.back().second));
+    startWorker(0);
+    modem0_->setScript(scriptOf(c.replies));
+    modem0_->clearCommands();
+    LogCapture cap;
+    ASSERT_EQ(0, push(0, c.request, {}));
+    EXPECT_EQ(c.param, g_asyncCmd.param);
+    if (c.request == REQUEST_GET_ATR) {
+      EXPECT_EQ(0, g_asyncCmd.datalen);
+    }
+    EXPECT_EQ(c.first, modem0_->commands());
+    if (c.log) {
+      EXPECT_TRUE(cap.contains(c.log, kTag)) << c.log;
+    }
+    modem0_->clearCommands();
+    ASSERT_EQ(0, push(0, c.request, {}));
+    EXPECT_EQ(c.param, g_asyncCmd.param);
+    EXPECT_EQ(c.again, modem0_->commands());
+    // What was learned is said once per port opening; a port opened again
+    // is asked afresh.
+    for (const char* query : {"does not know AT^CARDTYPE?", "does not know AT^CARDATR"}) {
+      EXPECT_LE(cap.find(query, kTag).size(), 1u) << query;
+    }
+    asyncCmdStop(0);
+  }
+  startWorker(0);
+  modem0_->setScript(scriptOf({{"AT^CARDTYPE?", okLine("^CARDTYPE: 1,1,0")}}));
+  modem0_->clearCommands();
+  ASSERT_EQ(0, push(0, REQUEST_GET_CARD_PRESENT, {}));
+  EXPECT_EQ(1, g_asyncCmd.param);
+  EXPECT_EQ(std::vector<std::string>{"AT^CARDTYPE?"}, modem0_->commands());
 }
 
 TEST_F(Engine, OpenLogicalChannelCommandTexts) {

@@ -30,5 +30,7 @@ int asyncCmdOpenPort(const char* path) {
     attempt = ++g_attempts[path];
   }
   if (hook) hook(path, attempt);
-  return open(path, O_RDWR | O_NOCTTY);
+  const int fd = open(path, O_RDWR | O_NOCTTY);
+  if (fd >= 0) (void)asyncCmdRawTerminal(fd, path);
+  return fd;
 }

@@ -10,6 +10,7 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <chrono>
 #include <filesystem>
 #include <fstream>
@@ -23,17 +24,22 @@ const char* const kModemSim = SE_MODEM_SIM_PATH;
 
 namespace fs = std::filesystem;
 
-TempRoot::TempRoot() {
+TempRoot::TempRoot(size_t length) {
   // A child that dies early must not take the test with it on the next write.
   signal(SIGPIPE, SIG_IGN);
   char tmpl[] = "/tmp/se_e2e.XXXXXX";
   if (mkdtemp(tmpl) == nullptr) throw std::runtime_error("mkdtemp");
-  path_ = tmpl;
+  top_ = path_ = tmpl;
+  while (path_.size() < length) {
+    const size_t part = std::min<size_t>(60, std::max<size_t>(1, length - path_.size() - 1));
+    path_ += "/" + std::string(part, 'd');
+  }
+  if (path_ != top_) fs::create_directories(path_);
 }
 
 TempRoot::~TempRoot() {
   std::error_code ec;
-  fs::remove_all(path_, ec);
+  fs::remove_all(top_, ec);
 }
 
 static void put(const std::string& path, const std::string& content, std::ios::openmode mode) {
@@ -200,7 +206,9 @@ bool Process::running() {
 
 std::unique_ptr<Process> startDaemon(const TempRoot& root) {
   auto d = std::make_unique<Process>(std::vector<std::string>{kDaemon}, root.path());
-  EXPECT_TRUE(d->err().waitFor("ZerbSimSecureElement Registered sim1 success")) << d->err().text();
+  EXPECT_TRUE(d->err().waitFor(
+      "AIDL Registered android.hardware.secure_element.ISecureElement/SIM1 success"))
+      << d->err().text();
   return d;
 }
 

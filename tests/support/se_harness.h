@@ -24,9 +24,11 @@ extern const char* const kSecli;
 extern const char* const kModemSim;
 
 // A fresh folder to serve as SE_DEVICE_ROOT, removed with everything in it.
+// With `length`, the folder is made that deep (at least that many characters
+// in its path), as a user's build or temporary folder may be.
 class TempRoot {
  public:
-  TempRoot();
+  explicit TempRoot(size_t length = 0);
   ~TempRoot();
   TempRoot(const TempRoot&) = delete;
   TempRoot& operator=(const TempRoot&) = delete;
@@ -39,6 +41,7 @@ class TempRoot {
   void property(const std::string& nameValue) const { append("properties", nameValue + "\n"); }
 
  private:
+  std::string top_;  // what mkdtemp made, removed whole
   std::string path_;
 };
 
@@ -97,7 +100,8 @@ class Process {
   std::unique_ptr<Output> err_;
 };
 
-// The daemon; waits until it has registered "SIM1", its last instance.
+// The daemon; waits until it has registered every instance, HIDL and AIDL
+// (the AIDL "SIM1" comes last).
 std::unique_ptr<Process> startDaemon(const TempRoot& root);
 // modem-sim for modem 0 or 1, logging on its standard error; waits for its
 // ready line.
@@ -138,6 +142,8 @@ void expectNoSanitizerReport(const std::string& who, const std::string& text);
 // daemon first (no port in use when the modem goes), checks it for sanitizer
 // reports and prints both logs when the test has failed.
 struct System {
+  System() = default;
+  explicit System(size_t rootLength) : root(rootLength) {}
   ~System();
   TempRoot root;
   std::unique_ptr<Process> modem;
