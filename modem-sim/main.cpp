@@ -55,6 +55,10 @@ const char kUsage[] =
     "                      answer unless --unsol gives EVERY)\n"
     "  --silent-on PREFIX  never answer a command starting with PREFIX (any case)\n"
     "  --close-after N     close the port (and remove the link) after N commands\n"
+    "  --channels-file F   keep in F the card's open logical channels: one line,\n"
+    "                      the numbers in ascending order separated by blanks\n"
+    "                      (empty: none; the basic channel is not listed),\n"
+    "                      rewritten (write and rename) whenever they change\n"
     "  --log FILE          log every line received (\"< ...\") and sent (\"> ...\")\n"
     "                      and events (\"# ...\") to FILE (default stderr)\n"
     "  --help              this text\n";
@@ -80,6 +84,7 @@ struct Options {
   std::string silentOn;
   long closeAfter = 0;
   std::string logPath;
+  std::string channelsFile;
 };
 
 bool parseLong(const char* s, long min, long max, long& out) {
@@ -173,6 +178,30 @@ class Modem {
 
   void shutdown() { closePort(); }
 
+  // Rewrites --channels-file when the card's open channels changed (and once
+  // at start), so a watcher never reads a half-written list.
+  void reportChannels() {
+    if (o_.channelsFile.empty()) return;
+    std::string now;
+    for (int c = 1; c < se_card::kMaxChannels; ++c) {
+      if (!responder_.card().isChannelOpen(c)) continue;
+      if (!now.empty()) now += ' ';
+      now += std::to_string(c);
+    }
+    if (reported_ && now == lastChannels_) return;
+    const std::string tmp = o_.channelsFile + ".tmp";
+    const std::string text = now + "\n";
+    const int fd = ::open(tmp.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0644);
+    const bool written = fd >= 0 && writeAll(fd, text.data(), text.size());
+    if (fd >= 0) close(fd);
+    if (!written || rename(tmp.c_str(), o_.channelsFile.c_str()) != 0) {
+      logLine("#", "cannot write " + o_.channelsFile + ": " + strerror(errno));
+      return;
+    }
+    reported_ = true;
+    lastChannels_ = now;
+  }
+
  private:
   static constexpr size_t kMaxLine = 4096;
 
@@ -213,6 +242,7 @@ class Modem {
     } else {
       answer(responder_.handle(line));
     }
+    reportChannels();
     if (o_.closeAfter > 0 && commands_ >= o_.closeAfter) {
       logLine("#", "closing the port after " + std::to_string(commands_) + " commands");
       awaitDrained();
@@ -289,6 +319,8 @@ class Modem {
   long commands_ = 0;
   long answers_ = 0;
   unsigned unsolTurn_ = 0;
+  bool reported_ = false;
+  std::string lastChannels_;
 
  public:
   const std::string& ptsName() const { return ptsName_; }
@@ -304,7 +336,7 @@ int usageError(const char* msg) {
 int main(int argc, char** argv) {
   enum {
     kRoot = 1000, kModem, kCardAbsent, kAtr, kChannels, kSessionBase, kDelay, kSplit, kUnsol, kSms, kSilent,
-    kCloseAfter, kLog, kHelp, kBareOpen, kShortLength
+    kCloseAfter, kLog, kHelp, kBareOpen, kShortLength, kChannelsFile
   };
   static const struct option longOpts[] = {
       {"root", required_argument, nullptr, kRoot},
@@ -322,6 +354,7 @@ int main(int argc, char** argv) {
       {"silent-on", required_argument, nullptr, kSilent},
       {"close-after", required_argument, nullptr, kCloseAfter},
       {"log", required_argument, nullptr, kLog},
+      {"channels-file", required_argument, nullptr, kChannelsFile},
       {"help", no_argument, nullptr, kHelp},
       {nullptr, 0, nullptr, 0},
   };
@@ -371,6 +404,7 @@ int main(int argc, char** argv) {
         if (!parseLong(optarg, 1, 1L << 40, o.closeAfter)) return usageError("--close-after takes a positive count");
         break;
       case kLog: o.logPath = optarg; break;
+      case kChannelsFile: o.channelsFile = optarg; break;
       case kHelp: fputs(kUsage, stdout); return 0;
       default: return usageError("unknown option");
     }
@@ -403,6 +437,7 @@ int main(int argc, char** argv) {
     modem.shutdown();
     return 1;
   }
+  modem.reportChannels();
   printf("modem-sim: modem %d ready on %s\n", o.modem, modem.ptsName().c_str());
   fflush(stdout);
   logLine("#", "modem " + std::to_string(o.modem) + " ready on " + modem.ptsName());
