@@ -41,6 +41,9 @@ struct CallContext {
   // the modem's restart...). When false any answer with a status word is a
   // clean "channel lost".
   bool channelCertain = true;
+  // reset: another client's init or reset ran at the same time, so state
+  // changes of its own may have reached this client's callback.
+  bool statesShared = false;
   bool libFail = false;  // the eSE library failing exchanges during the call
   bool cardOut = false;  // PC/SC: the card out of its reader during the call
   bool pcsc = false;

@@ -20,8 +20,8 @@ bool touchesDevice(Kind k) { return k == Kind::Transmit || k == Kind::Open || k 
 
 }  // namespace
 
-Judge::Judge(uint64_t seed, const BoundConfig& bounds, bool pcsc, int64_t origin, FILE* out)
-    : seed_(seed), bounds_(bounds), pcsc_(pcsc), origin_(origin), out_(out) {}
+Judge::Judge(uint64_t seed, const BoundConfig& bounds, bool pcsc, int64_t origin, FILE* out, int shown)
+    : seed_(seed), bounds_(bounds), pcsc_(pcsc), origin_(origin), out_(out), shown_(shown) {}
 
 std::string Judge::at(int64_t t) const {
   char b[32];
@@ -69,7 +69,7 @@ void Judge::callStarted(int slot, int gen, long seq, Kind kind, Inst inst, int c
   // sweeps what earlier clients left); a close, that channel for whoever
   // holds its number now.
   const size_t i = kind == Kind::Close ? addDrop(inst, t0, INT64_MAX, channel, {slot, gen})
-                                       : addDrop(inst, t0, INT64_MAX);
+                                       : addDrop(inst, t0, INT64_MAX, -1, {slot, gen});
   openDrops_[{slot, gen, seq}] = i;
   dropsOfClient_[{slot, gen}].push_back(i);
 }
@@ -137,8 +137,8 @@ std::string Judge::describe(const CallRecord& r) const {
 }
 
 void Judge::violation(const std::string& invariant, const CallRecord& r, const std::vector<FaultSpan>& active) {
-  if (++reported_ > 20) {
-    if (reported_ == 21) fprintf(out_, "chaos: (further violations counted, not shown)\n");
+  if (++reported_ > shown_) {
+    if (reported_ == shown_ + 1) fprintf(out_, "chaos: (further violations counted, not shown)\n");
     return;
   }
   std::string faults;
@@ -191,6 +191,12 @@ void Judge::judge(const CallRecord& r) {
   CallContext c;
   c.pcsc = pcsc_;
   c.channelCertain = channelCertain(r);
+  for (const Drop& d : drops_) {
+    if (d.inst == r.inst && d.channel < 0 && d.by.first >= 0 && d.by != std::make_pair(r.slot, r.gen) &&
+        d.start <= r.t1 && d.end >= r.t0) {
+      c.statesShared = true;
+    }
+  }
   for (const FaultSpan& s : same) {
     // The library reads its switches on each call: a little either side.
     const bool during = s.start <= r.t1 + 100 * kMs && (s.end == INT64_MAX || s.end + 100 * kMs >= r.t0);

@@ -35,7 +35,7 @@ struct Worst {
 
 class Judge {
  public:
-  Judge(uint64_t seed, const BoundConfig& bounds, bool pcsc, int64_t origin, FILE* out);
+  Judge(uint64_t seed, const BoundConfig& bounds, bool pcsc, int64_t origin, FILE* out, int shown = 20);
 
   // From the fault thread.
   void faultStarted(const Fault& f, int64_t at);
@@ -101,6 +101,7 @@ class Judge {
   std::map<std::pair<Inst, Iface>, Tally> tallies_;
   Worst worst_[kKinds][2];
   long calls_ = 0, wrong_ = 0, over_ = 0, callsCut_ = 0;
+  int shown_;
   int reported_ = 0;
   size_t pruneAt_ = 2000;
 };

@@ -21,7 +21,7 @@ namespace {
 
 const char kUsage[] =
     "usage: se-chaos [--seconds N] [--seed S] [--pcsc] [--hang-ms MS] [--bin DIR]\n"
-    "                [--lib DIR] [--keep] [--verbose]\n"
+    "                [--lib DIR] [--keep] [--verbose] [--show N]\n"
     "\n"
     "Starts modem-sim behind a fault-injecting relay, the daemon with the simulated\n"
     "eSE library (or, with --pcsc, the PC/SC library, pcscd and card-vpcd) in a fresh\n"
@@ -47,6 +47,7 @@ const char kUsage[] =
     "  --keep        keep the device root (it is kept anyway when a check fails)\n"
     "  --verbose     print every fault's start and end and every kill as they happen\n"
     "                (they always go to chaos.log in the device root)\n"
+    "  --show N      violations printed in full (default 20; all are counted)\n"
     "  --help        this text\n";
 
 std::string selfPath() {
@@ -83,12 +84,13 @@ int main(int argc, char** argv) {
   }
   chaos::RunOptions o;
   o.seed = static_cast<uint64_t>(time(nullptr)) % 1000000;
-  enum { kSeconds = 1000, kSeed, kPcsc, kHang, kBin, kLib, kKeep, kVerbose, kHelp };
+  enum { kSeconds = 1000, kSeed, kPcsc, kHang, kBin, kLib, kKeep, kVerbose, kShow, kHelp };
   static const option longOpts[] = {
       {"seconds", required_argument, nullptr, kSeconds}, {"seed", required_argument, nullptr, kSeed},
       {"pcsc", no_argument, nullptr, kPcsc},             {"hang-ms", required_argument, nullptr, kHang},
       {"bin", required_argument, nullptr, kBin},         {"lib", required_argument, nullptr, kLib},
       {"keep", no_argument, nullptr, kKeep},             {"verbose", no_argument, nullptr, kVerbose},
+      {"show", required_argument, nullptr, kShow},
       {"help", no_argument, nullptr, kHelp},             {nullptr, 0, nullptr, 0}};
   int c;
   unsigned long long v = 0;
@@ -111,6 +113,10 @@ int main(int argc, char** argv) {
       case kLib: o.libDir = optarg; break;
       case kKeep: o.keep = true; break;
       case kVerbose: o.verbose = true; break;
+      case kShow:
+        if (!parseNumber(optarg, 1000000, &v)) return usageError("--show takes a count");
+        o.shown = static_cast<int>(v);
+        break;
       case kHelp: fputs(kUsage, stdout); return 0;
       default: return usageError("unknown option");
     }

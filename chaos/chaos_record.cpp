@@ -137,7 +137,7 @@ bool decodeRecord(const std::string& line, CallRecord* out) {
     if (!ok) return false;
     ++fields;
   }
-  if (fields != 23) return false;
+  if (fields != 22) return false;
   *out = std::move(r);
   return true;
 }

@@ -72,7 +72,7 @@ class Run {
     if (!warmUp()) return finish(false);
     start_ = healthOf(daemon_.pid());
     origin_ = monoNanos();
-    judge_ = std::make_unique<Judge>(o_.seed, bounds_, o_.pcsc, origin_, stdout);
+    judge_ = std::make_unique<Judge>(o_.seed, bounds_, o_.pcsc, origin_, stdout, o_.shown);
     chaosPhase();
     return finish(true);
   }

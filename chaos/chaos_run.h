@@ -18,6 +18,7 @@ struct RunOptions {
   int hangMs = 3000;
   bool keep = false;
   bool verbose = false;
+  int shown = 20;  // violations printed in full
 };
 
 // The exit status: 0 when every invariant held, 1 when one did not, 2 when
