@@ -240,7 +240,14 @@ void Judge::judge(const CallRecord& r) {
              static_cast<long long>(boundMs));
     violation(b, r, same);
   }
-  Worst& w = worst_[static_cast<int>(r.kind)][(same.empty() && !other) ? 0 : 1];
+  // "A fault active": one on either instance while the call ran (the
+  // tails that widen the bound do not count here).
+  bool active = false;
+  for (auto it = faults_.rbegin(); it != faults_.rend() && !active; ++it) {
+    active = it->start <= r.t1 && (it->end == INT64_MAX || it->end >= r.t0);
+    if (it->start + 20000 * kMs < r.t0) break;
+  }
+  Worst& w = worst_[static_cast<int>(r.kind)][active ? 1 : 0];
   if (tookNs > w.ns) {
     w.ns = tookNs;
     w.boundMs = boundMs;

@@ -171,6 +171,7 @@ class Run {
       const int64_t deadline = monoNanos() + 30000 * kMs;
       while (p->fd >= 0 && monoNanos() < deadline && !g_stop) pump(50);
     }
+    if (g_stop) return false;
     usleep(500000);
     judge_->judgeUpTo(INT64_MAX);
     if (judge_->wrong() > 0 || judge_->calls() < 20) {
@@ -485,6 +486,7 @@ class Run {
     sum.seconds = o_.seconds;
     sum.start = start_;
     long open = 0;
+    if (g_stop) ran = false;  // interrupted: stop everything, check nothing more
     if (ran && !daemonDied_) {
       // Devices healed, clients gone: nudge each instance once (a call on a
       // device that answers runs the closes queued for it), then wait for the
@@ -534,7 +536,7 @@ class Run {
     if (g_stop) printf("chaos: interrupted\n");
     printReport(stdout, *judge_, sum);
     const bool pass = healthy && !g_stop && judge_->wrong() == 0 && judge_->over() == 0 && open == 0;
-    if (!pass) keep_ = true;
+    if (!pass && !g_stop) keep_ = true;
     if (keep_ || o_.keep) printf("chaos: device root kept: %s (chaos.log, daemon.log)\n", root_.c_str());
     return pass ? 0 : 1;
   }
