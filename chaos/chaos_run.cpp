@@ -512,9 +512,11 @@ class Run {
         usleep(100000);
       } while (monoNanos() < deadline);
       if (open > 0) {
-        printf("chaos: VIOLATION seed %llu: %ld channel(s) left open after every client went (eSE: \"%s\", modem: \"%s\")\n",
-               static_cast<unsigned long long>(o_.seed), open, firstLine(eseReport()).c_str(),
-               firstLine(root_ + "/modem-channels").c_str());
+        const std::string ese = o_.pcsc ? std::to_string(pcsc_ ? pcsc_->openChannels() : -1) + " on the card"
+                                         : "\"" + firstLine(eseReport()) + "\"";
+        printf("chaos: VIOLATION seed %llu: %ld channel(s) left open after every client went (eSE: %s, modem: "
+               "\"%s\")\n",
+               static_cast<unsigned long long>(o_.seed), open, ese.c_str(), firstLine(root_ + "/modem-channels").c_str());
       }
       usleep(500000);
       sum.end = healthOf(daemon_.pid());
