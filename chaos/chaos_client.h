@@ -20,8 +20,11 @@ struct ClientArgs {
   Iface iface = Iface::Hidl;
   int fd = -1;  // where records go
   // A short fixed sequence (init, open, transmit, close, presence, ATR),
-  // then a tidy exit: the warm-up, and the nudge at the end.
+  // then a tidy exit: the warm-up.
   bool probe = false;
+  // Presence and ATR only, then a tidy exit: at the end, a call on each
+  // instance that opens and closes nothing.
+  bool nudge = false;
 };
 
 // The arguments that select client mode in se-chaos's command line.

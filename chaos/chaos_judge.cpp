@@ -78,7 +78,7 @@ void Judge::callEnded(const CallRecord& r) {
   std::lock_guard<std::mutex> l(mu_);
   auto it = openDrops_.find({r.slot, r.gen, r.seq});
   if (it != openDrops_.end()) {
-    drops_[it->second].end = r.t1 + (r.kind == Kind::Close ? 0 : kSettleMarginNs);
+    drops_[it->second].end = r.t1;  // what an init, a reset or a close does, it does in the call
     openDrops_.erase(it);
   }
   queue_.push_back(r);
@@ -205,6 +205,10 @@ void Judge::judge(const CallRecord& r) {
     if (s.fault.kind == FaultKind::CardOut) c.cardOut = true;
   }
   const Verdict v = classify(r, c);
+  if (r.kind == Kind::Transmit && r.appletKnown) {
+    ++transmits_;
+    if (c.channelCertain) ++transmitsChecked_;
+  }
 
   std::vector<Fault> weighing;
   for (const FaultSpan& s : same) weighing.push_back(s.fault);

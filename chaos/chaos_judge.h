@@ -57,6 +57,10 @@ class Judge {
   long over() const { return over_; }
   long calls() const { return calls_; }
   long callsCut() const { return callsCut_; }
+  // Transmits on a logical channel, and those of them whose answer could be
+  // checked byte for byte (the channel certainly still the client's).
+  long transmits() const { return transmits_; }
+  long transmitsChecked() const { return transmitsChecked_; }
   // [kind][0: no fault active, 1: a fault active]
   const Worst& worst(Kind k, int faulted) const { return worst_[static_cast<int>(k)][faulted]; }
   std::vector<FaultSpan> faults() const;
@@ -100,7 +104,7 @@ class Judge {
 
   std::map<std::pair<Inst, Iface>, Tally> tallies_;
   Worst worst_[kKinds][2];
-  long calls_ = 0, wrong_ = 0, over_ = 0, callsCut_ = 0;
+  long calls_ = 0, wrong_ = 0, over_ = 0, callsCut_ = 0, transmits_ = 0, transmitsChecked_ = 0;
   int shown_;
   int reported_ = 0;
   size_t pruneAt_ = 2000;

@@ -141,8 +141,8 @@ Plan makePlan(uint64_t seed, int64_t durationMs, bool pcsc) {
   std::stable_sort(p.faults.begin(), p.faults.end(),
                    [](const Fault& a, const Fault& b) { return a.startMs < b.startMs; });
 
-  // A client killed every 1.5 s on average, the slot drawn at random.
-  for (int64_t t = d.between(500, 3000); t < durationMs - 2000; t += d.between(300, 2700)) {
+  // A client killed every 3 s on average, the slot drawn at random.
+  for (int64_t t = d.between(500, 5000); t < durationMs - 2000; t += d.between(1000, 5000)) {
     p.kills.push_back({static_cast<int>(d.between(0, static_cast<int64_t>(p.slots.size()) - 1)), t});
   }
   return p;

@@ -23,6 +23,9 @@ void printReport(FILE* out, const Judge& j, const Summary& s) {
             t.clean, t.wrong, t.over);
   }
 
+  fprintf(out, "  transmits on a channel the client opened: %ld, answers checked byte for byte: %ld\n",
+          j.transmits(), j.transmitsChecked());
+
   std::map<FaultKind, std::pair<long, double>> byKind;
   for (const FaultSpan& f : j.faults()) {
     auto& e = byKind[f.fault.kind];

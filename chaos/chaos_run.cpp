@@ -43,6 +43,7 @@ struct SlotState {
   Slot slot;
   int index = 0;
   bool probe = false;
+  bool nudge = false;
   int gen = -1;
   Proc proc;
   int fd = -1;
@@ -194,7 +195,8 @@ class Run {
     a.inst = s.slot.inst;
     a.iface = s.slot.iface;
     a.fd = 3;
-    a.probe = s.probe;
+    a.probe = s.probe && !s.nudge;
+    a.nudge = s.nudge;
     std::vector<std::string> argv = {o_.self};
     for (const std::string& w : clientArgv(a)) argv.push_back(w);
     if (!s.proc.start(argv, {}, -1, root_ + "/clients.err", p[1])) {
@@ -498,6 +500,7 @@ class Run {
         s->slot = {inst, Iface::Hidl};
         s->index = 200 + k++;
         s->probe = true;
+        s->nudge = true;
         probes_.push_back(std::move(s));
       }
       for (auto& p : probes_) {
