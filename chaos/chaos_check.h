@@ -45,6 +45,9 @@ struct CallContext {
   // changes of its own may have reached this client's callback.
   bool statesShared = false;
   bool libFail = false;  // the eSE library failing exchanges during the call
+  // ... and the status word it leaves behind (0: none). eSE1 hands a failed
+  // exchange's leftover status word on as the answer: a documented failure.
+  int libFailSw = 0;
   bool cardOut = false;  // PC/SC: the card out of its reader during the call
   bool pcsc = false;
 };

@@ -201,7 +201,10 @@ void Judge::judge(const CallRecord& r) {
     // The library reads its switches on each call: a little either side.
     const bool during = s.start <= r.t1 + 100 * kMs && (s.end == INT64_MAX || s.end + 100 * kMs >= r.t0);
     if (!during) continue;
-    if (s.fault.kind == FaultKind::LibFail) c.libFail = true;
+    if (s.fault.kind == FaultKind::LibFail) {
+      c.libFail = true;
+      if (s.fault.a != 0) c.libFailSw = s.fault.a;
+    }
     if (s.fault.kind == FaultKind::CardOut) c.cardOut = true;
   }
   const Verdict v = classify(r, c);

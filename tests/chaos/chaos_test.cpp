@@ -112,6 +112,12 @@ TEST(ChaosCheck, AnswersAreRightCleanFailuresOrWrong) {
        certain, Outcome::Wrong},
   };
   for (const Case& c : cases) EXPECT_EQ(classify(c.r, c.c).outcome, c.want) << c.what;
+  CallContext failing;
+  failing.libFail = true;
+  failing.libFailSw = 0x6F00;
+  EXPECT_EQ(classify(transmit(Inst::Ese, Iface::Aidl, echo, {0x6F, 0x00}), failing).outcome, Outcome::Clean)
+      << "the failed exchange's status word";
+  EXPECT_EQ(classify(transmit(Inst::Ese, Iface::Aidl, echo, {0x6F, 0x00}), certain).outcome, Outcome::Wrong);
 
   auto call = [](Kind k, Inst inst, Iface iface) {
     CallRecord r;
