@@ -68,7 +68,7 @@ Answer echoWithStatus(const Command& cmd, const ChannelContext&) {
 constexpr size_t kBigDefault = 300;
 constexpr size_t kBigMax = 4096;
 
-Answer bigPattern(const Command& cmd, bool viaGetResponse) {
+Answer bigPattern(const Command& cmd, bool viaGetResponse, bool whole = false) {
   size_t n = (static_cast<size_t>(cmd.p1) << 8) | cmd.p2;
   if (n == 0) n = kBigDefault;
   if (n > kBigMax) return Answer{{}, SW_INCORRECT_P1P2, false};
@@ -76,15 +76,17 @@ Answer bigPattern(const Command& cmd, bool viaGetResponse) {
   a.data.resize(n);
   for (size_t i = 0; i < n; ++i) a.data[i] = static_cast<uint8_t>(i & 0xFF);
   a.viaGetResponse = viaGetResponse;
+  a.whole = whole;
   return a;
 }
 
 Answer bigNow(const Command& cmd, const ChannelContext&) { return bigPattern(cmd, false); }
 Answer bigLater(const Command& cmd, const ChannelContext&) { return bigPattern(cmd, true); }
+Answer bigWhole(const Command& cmd, const ChannelContext&) { return bigPattern(cmd, false, true); }
 
 class BigApplet : public Applet {
  public:
-  BigApplet() : Applet("big", aid::kBig, {{0x10, bigNow}, {0x11, bigLater}}) {}
+  BigApplet() : Applet("big", aid::kBig, {{0x10, bigNow}, {0x11, bigLater}, {0x12, bigWhole}}) {}
   Answer onSelect(const Command&, const ChannelContext&) const override {
     // Some proprietary filler so the FCI is worth fetching.
     std::vector<uint8_t> extra = {0xA5, 0x10};

@@ -18,7 +18,11 @@
 //                                  ..., sent at once when they fit one
 //                                  response (256), else 61 00 and GET RESPONSE
 //                                  chunks. INS 11: the same bytes, always left
-//                                  for GET RESPONSE (61 xx).
+//                                  for GET RESPONSE (61 xx). INS 12: the same
+//                                  bytes in one response however many, Le
+//                                  not looked at, as a card answering with
+//                                  an extended length: for tests of the
+//                                  callers' buffers at their edge.
 //   P2    A0 00 00 00 01 03        reports the P2 of the SELECT that selected
 //                                  it on the channel: its FCI holds the P2
 //                                  under tag 85, and INS 20 returns that one
@@ -59,6 +63,8 @@ struct Answer {
   uint16_t sw = 0x9000;
   // Leave the data for GET RESPONSE (answer 61 xx) even when it fits.
   bool viaGetResponse = false;
+  // Send the data in one response whatever its length and the Le.
+  bool whole = false;
 };
 
 // Per-channel facts an applet may read.

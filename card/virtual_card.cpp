@@ -207,6 +207,7 @@ std::vector<uint8_t> VirtualCard::getResponse(const Command& cmd, Channel& ch) {
 
 std::vector<uint8_t> VirtualCard::deliver(const Command& cmd, Channel& ch, Answer answer) {
   if (answer.data.empty()) return swOnly(answer.sw);
+  if (answer.whole) return withSw(std::move(answer.data), answer.sw);
   if (answer.viaGetResponse || answer.data.size() > kMaxResponseData) {
     ch.pending = std::move(answer.data);
     return swOnly(withCount(SW_BYTES_AVAILABLE, ch.pending.size()));

@@ -45,7 +45,7 @@ class VirtualCard {
   explicit VirtualCard(CardOptions options = CardOptions());
 
   // One command APDU in, one response APDU (data, then SW1 SW2) out. The
-  // response never holds more than 256 data bytes.
+  // response holds at most 256 data bytes, but for BIG's INS 12.
   std::vector<uint8_t> process(const std::vector<uint8_t>& apdu);
 
   // Power cycle: every logical channel closed, the ISD selected on the basic

@@ -20,6 +20,12 @@
 //                                lock (so open and close wait too), until the
 //                                property is cleared; "hanging" and "released"
 //                                are logged
+//   vendor.ese_sim.slow_p1       a hex byte (e.g. 42): an exchange, by either
+//   vendor.ese_sim.slow_ms       function, whose P1 equals it takes slow_ms
+//                                milliseconds before the card answers, as a
+//                                card busy generating a key; the library's
+//                                lock is held meanwhile, as for any exchange,
+//                                and the start of the wait is logged
 // Flags take 1, true, yes or on.
 //
 // Open channels report: whenever the set of the card's open logical channels
@@ -212,7 +218,44 @@ void hangWhileAsked(const char* fn) {
   __android_log_print(ANDROID_LOG_ERROR, kTag, "%s: released", fn);
 }
 
+// P1 as vendor.ese_sim.slow_p1 names it: one or two hex digits, "0x" allowed.
+// -1 when unset or not a byte.
+int slowP1() {
+  const std::string v = propertyText("vendor.ese_sim.slow_p1");
+  if (v.empty()) return -1;
+  char* end = nullptr;
+  const unsigned long n = strtoul(v.c_str(), &end, 16);
+  if (end == v.c_str() || *end != '\0' || n > 0xFF || v[0] == '-' || v[0] == '+') {
+    __android_log_print(ANDROID_LOG_ERROR, kTag, "property vendor.ese_sim.slow_p1=\"%s\" is not a hex byte", v.c_str());
+    return -1;
+  }
+  return static_cast<int>(n);
+}
+
+// A healthy but long command: the card answers only after
+// vendor.ese_sim.slow_ms milliseconds, measured on the monotonic clock.
+void slowIfAsked(const std::vector<uint8_t>& apdu, const char* route) {
+  if (apdu.size() < 4) return;
+  const int p1 = slowP1();
+  if (p1 < 0 || apdu[2] != p1) return;
+  const int32_t ms = propertyInt("vendor.ese_sim.slow_ms", 0);
+  if (ms <= 0) return;
+  __android_log_print(ANDROID_LOG_INFO, kTag, "%s: slow command (P1 %02X), answering in %d ms", route, p1,
+                      static_cast<int>(ms));
+  struct timespec until;
+  clock_gettime(CLOCK_MONOTONIC, &until);
+  until.tv_sec += ms / 1000;
+  until.tv_nsec += (ms % 1000) * 1000000L;
+  if (until.tv_nsec >= 1000000000L) {
+    until.tv_sec += 1;
+    until.tv_nsec -= 1000000000L;
+  }
+  while (clock_nanosleep(CLOCK_MONOTONIC, TIMER_ABSTIME, &until, nullptr) == EINTR) {
+  }
+}
+
 std::vector<uint8_t> exchange(Ese& e, const std::vector<uint8_t>& apdu, const char* route) {
+  slowIfAsked(apdu, route);
   const int first = isAssigningOpen(apdu) ? propertyInt("vendor.ese_sim.min_channel", 1) : 1;
   std::vector<uint8_t> r = first > 1 ? openFrom(e, apdu, first) : e.card.process(apdu);
   reportOpenChannels(e);

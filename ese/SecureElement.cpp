@@ -2,6 +2,7 @@
 
 #include <atomic>
 #include <cstdlib>
+#include <string>
 #include <memory>
 #include <vector>
 
@@ -11,6 +12,7 @@
 #include "ese_buffer.h"
 #include "ese_library.h"
 #include "ese_qv_hal.h"
+#include "se_device_gate.h"
 
 namespace android {
 namespace hardware {
@@ -60,24 +62,6 @@ Buffer allocBuffer(size_t size, bool zeroFill) {
 }
 
 namespace lib = ese_library;
-
-// Holds the front's lock for one operation, unless the caller gave up because
-// the holder is stuck in the library; the operation then fails as it does
-// when the library fails.
-class EseLock {
- public:
-  EseLock(pthread_mutex_t* m, const char* op) : m_(m), held_(lib::lockFront(m, op)) {}
-  ~EseLock() {
-    if (held_) pthread_mutex_unlock(m_);
-  }
-  EseLock(const EseLock&) = delete;
-  EseLock& operator=(const EseLock&) = delete;
-  bool held() const { return held_; }
-
- private:
-  pthread_mutex_t* m_;
-  bool held_;
-};
 
 bool isTracked(uint8_t channel) { return channel < kTrackedChannels; }
 
@@ -163,22 +147,41 @@ void fillSelect(phQvEse_7816_cpdu* cpdu, phQvEse_7816_rpdu* rpdu, uint8_t cla, u
   rpdu->len = 2;
 }
 
+// What a close's exchange came to: the library failed (the card never saw
+// it), or the card answered, with 90 00 or with a refusal.
+enum class CloseResult { kLibraryFailed, kClosed, kRefused };
+
+DeviceGate::Outcome outcomeOf(CloseResult r) {
+  return r == CloseResult::kLibraryFailed ? DeviceGate::Outcome::kRetry
+                                          : DeviceGate::Outcome::kDone;
+}
+
+CloseResult closeTracked(uint8_t channel, const char* op);
+
+// A close of `channel` the library could not make now, made again later.
+void closeLater(uint8_t channel, const char* op) {
+  SecureElement::gate().defer([channel, op] { return outcomeOf(closeTracked(channel, op)); },
+                              std::string(op) + ", close of channel " + std::to_string(channel),
+                              channel);
+}
+
 // Logs the closing and the outcome of a failed logical open's clean-up.
 void failedSelectClose(const char* op, uint8_t channel) {
   __android_log_print(ANDROID_LOG_DEBUG, kTag, "%s select return fail,try to close channel %d", op,
                       channel);
-  if (SecureElement::internalCloseChannel(channel) != SecureElementStatus::SUCCESS) {
+  const CloseResult r = closeTracked(channel, "internalCloseChannel");
+  if (r != CloseResult::kClosed) {
     __android_log_print(ANDROID_LOG_ERROR, kTag, "%s select return fail,close channel fail ", op);
   }
+  if (r == CloseResult::kLibraryFailed) closeLater(channel, op);
 }
 
-// MANAGE CHANNEL close of `channel`, sent on the channel named by `cla`;
-// SUCCESS when the card answers 90 00.
-SecureElementStatus manageClose(uint8_t cla, uint8_t channel, const char* op) {
+// MANAGE CHANNEL close of `channel`, sent on the channel named by `cla`.
+CloseResult manageClose(uint8_t cla, uint8_t channel, const char* op) {
   Buffer rsp = allocBuffer(kRspBufSize, true);
   if (!rsp) {
     __android_log_print(ANDROID_LOG_ERROR, kTag, "%s rpdu.pdata malloc fail!", op);
-    return SecureElementStatus::FAILED;
+    return CloseResult::kLibraryFailed;
   }
   phQvEse_7816_cpdu cpdu;
   phQvEse_7816_rpdu rpdu;
@@ -194,24 +197,35 @@ SecureElementStatus manageClose(uint8_t cla, uint8_t channel, const char* op) {
   cpdu.le = 0x9000;
   rpdu.pdata = rsp.get();
   rpdu.len = 0;
-  if (lib::transceive(&cpdu, &rpdu) == 0 && rpdu.sw1 == 0x90 && rpdu.sw2 == 0x00) {
-    return SecureElementStatus::SUCCESS;
-  }
-  return SecureElementStatus::FAILED;
+  if (lib::transceive(&cpdu, &rpdu) != 0) return CloseResult::kLibraryFailed;
+  return rpdu.sw1 == 0x90 && rpdu.sw2 == 0x00 ? CloseResult::kClosed : CloseResult::kRefused;
 }
 
 // The close shared by closeChannel and internalCloseChannel; `op` names the
-// caller in the log.
-SecureElementStatus closeChannelUnlocked(uint8_t channel, const char* op) {
+// caller in the log. Channel 0 is the basic channel, never closed. Above 3
+// the CLA would not be the channel number, so a close built from it would
+// hit another channel; this front never hands such a channel out, so there
+// is nothing to close.
+CloseResult closeTracked(uint8_t channel, const char* op) {
   __android_log_print(ANDROID_LOG_INFO, kTag, "%s enter!", op);
-  SecureElementStatus status = SecureElementStatus::FAILED;
-  if (isTracked(channel)) g_openedChannels[channel].store(0);
-  // Channel 0 is the basic channel, never closed. Above 3 the CLA would not be
-  // the channel number, so a close built from it would hit another channel;
-  // this front never hands such a channel out, so there is nothing to close.
-  if (channel != 0 && isTracked(channel)) status = manageClose(channel, channel, op);
+  CloseResult r = CloseResult::kRefused;
+  if (channel != 0 && isTracked(channel)) r = manageClose(channel, channel, op);
+  // A close the library could not make stays owed: the flag stays for init's
+  // sweep and the gate makes it again.
+  if (isTracked(channel) && r != CloseResult::kLibraryFailed) {
+    g_openedChannels[channel].store(0);
+    SecureElement::gate().closed(channel);
+  }
   powerOff();
-  return status;
+  return r;
+}
+
+SecureElementStatus statusOf(CloseResult r) {
+  return r == CloseResult::kClosed ? SecureElementStatus::SUCCESS : SecureElementStatus::FAILED;
+}
+
+DeviceGate::Outcome closeForGate(uint8_t channel) {
+  return outcomeOf(closeTracked(channel, "internalCloseChannel"));
 }
 
 }  // namespace
@@ -229,23 +243,42 @@ ThreadMutex::ThreadMutex() {
 
 ThreadMutex::~ThreadMutex() { pthread_mutex_destroy(&m_mutex); }
 
+DeviceGate& SecureElement::gate() {
+  // Lives as long as the process: a pool thread may still be in the library
+  // when the process exits.
+  static DeviceGate* instance = new DeviceGate(DeviceGate::Config{
+      "eSE1", LOG_ID_MAIN, kTag, g_eseMutex.get(), kCallersPerInstance,
+      "vendor.secure_element.ese.hang_ms", lib::silenceMicros, closeForGate});
+  return *instance;
+}
+
 Return<void> SecureElement::init(const sp<ISecureElementHalCallback>& clientCallback) {
   __android_log_print(ANDROID_LOG_INFO, kTag, "%s enter!", "init");
   if (clientCallback == nullptr) {
     __android_log_print(ANDROID_LOG_ERROR, kTag, "clientCallback IS NULL");
     return Void();
   }
-  clientCallback->linkToDeath(sp<hidl_death_recipient>(this), 0);
+  bool opened = false;
+  {
+    DeviceGate::Pass pass = gate().enter("init");
+    if (!pass.ok()) return Void();
+    clientCallback->linkToDeath(sp<hidl_death_recipient>(this), 0);
 
-  // Channels left open by a client that went away are closed once the eSE
-  // says it is ready; channel 0 is the basic channel and never closed.
-  if (lib::readyStatus() == 0) {
-    for (uint8_t c = 1; c < kTrackedChannels; ++c) {
-      if (g_openedChannels[c].load() == 1) internalCloseChannel(c);
+    // Channels left open by a client that went away are closed once the eSE
+    // says it is ready; channel 0 is the basic channel and never closed.
+    if (lib::readyStatus() == 0) {
+      for (uint8_t c = 1; c < kTrackedChannels; ++c) {
+        if (g_openedChannels[c].load() == 1 &&
+            closeTracked(c, "internalCloseChannel") == CloseResult::kLibraryFailed) {
+          closeLater(c, "init");
+        }
+      }
     }
+    opened = lib::initOpen() == 0;
   }
-
-  if (lib::initOpen() == 0) {
+  // The client hears of it with the library free: a slow client does not
+  // hold up other callers.
+  if (opened) {
     clientCallback->onStateChange(true);
   } else {
     __android_log_print(ANDROID_LOG_ERROR, kTag, "phQvEse_init_open FAIL");
@@ -266,8 +299,8 @@ Return<bool> SecureElement::isCardPresent() {
 
 Return<void> SecureElement::transmit(const hidl_vec<uint8_t>& data, transmit_cb _hidl_cb) {
   static const char* const kOp = "transmit";
-  EseLock lock(g_eseMutex.get(), kOp);
-  if (!lock.held()) {
+  DeviceGate::Pass pass = gate().enter(kOp);
+  if (!pass.ok()) {
     _hidl_cb(hidl_vec<uint8_t>{kMarkerTransmitFailed});
     return Void();
   }
@@ -288,6 +321,7 @@ Return<void> SecureElement::transmit(const hidl_vec<uint8_t>& data, transmit_cb 
   Buffer cmdBuf = allocBuffer(cmd.size(), false);
   if (!cmdBuf) {
     __android_log_print(ANDROID_LOG_ERROR, kTag, "%s cmdApdu.p_data malloc fail!", kOp);
+    se_call::markFailed();
     _hidl_cb(hidl_vec<uint8_t>{kMarkerTransmitFailed});
     return Void();
   }
@@ -295,6 +329,7 @@ Return<void> SecureElement::transmit(const hidl_vec<uint8_t>& data, transmit_cb 
   Buffer rspBuf = allocBuffer(kRspBufSize, true);
   if (!rspBuf) {
     __android_log_print(ANDROID_LOG_ERROR, kTag, "%s rspApdu.p_data malloc fail!", kOp);
+    se_call::markFailed();
     _hidl_cb(hidl_vec<uint8_t>{kMarkerTransmitFailed});
     return Void();
   }
@@ -307,6 +342,7 @@ Return<void> SecureElement::transmit(const hidl_vec<uint8_t>& data, transmit_cb 
   } else {
     response = hidl_vec<uint8_t>{kMarkerTransmitFailed};
     __android_log_print(ANDROID_LOG_ERROR, kTag, "transmit failed!!!");
+    se_call::markFailed();
     if (rspLen >= 2) response = bytesOf(rspBuf.get(), rspLen);
   }
   _hidl_cb(response);
@@ -316,8 +352,8 @@ Return<void> SecureElement::transmit(const hidl_vec<uint8_t>& data, transmit_cb 
 Return<void> SecureElement::openLogicalChannel(const hidl_vec<uint8_t>& aid, uint8_t p2,
                                                openLogicalChannel_cb _hidl_cb) {
   static const char* const kOp = "openLogicalChannel";
-  EseLock lock(g_eseMutex.get(), kOp);
-  if (!lock.held()) {
+  DeviceGate::Pass pass = gate().enter(kOp);
+  if (!pass.ok()) {
     LogicalChannelResponse failed;
     failed.channelNumber = kMarkerExchangeFailed;
     _hidl_cb(failed, SecureElementStatus::FAILED);
@@ -397,8 +433,14 @@ Return<void> SecureElement::openLogicalChannel(const hidl_vec<uint8_t>& aid, uin
   if (!isTracked(channel)) {
     __android_log_print(ANDROID_LOG_ERROR, kTag, "%s card assigned channel %d, closing it", kOp,
                         channel);
-    if (manageClose(0x00, channel, kOp) != SecureElementStatus::SUCCESS) {
+    const CloseResult r = manageClose(0x00, channel, kOp);
+    if (r != CloseResult::kClosed) {
       __android_log_print(ANDROID_LOG_ERROR, kTag, "%s close of channel %d failed", kOp, channel);
+    }
+    if (r == CloseResult::kLibraryFailed) {
+      gate().defer([channel] { return outcomeOf(manageClose(0x00, channel, "openLogicalChannel")); },
+                   "openLogicalChannel, close of refused channel " + std::to_string(channel),
+                   channel);
     }
     deliverUnassigned(kNoChannel, SecureElementStatus::CHANNEL_NOT_AVAILABLE);
     return Void();
@@ -406,6 +448,7 @@ Return<void> SecureElement::openLogicalChannel(const hidl_vec<uint8_t>& aid, uin
 
   result.channelNumber = channel;
   g_openedChannels[channel].store(1);
+  gate().opened(channel, se_call::callerPid());
 
   Buffer aidBuf = allocBuffer(aid.size(), true);
   if (!aidBuf) {
@@ -472,8 +515,8 @@ Return<void> SecureElement::openBasicChannel(const hidl_vec<uint8_t>& aid, uint8
                                              openBasicChannel_cb _hidl_cb) {
   static const char* const kOp = "openBasicChannel";
   __android_log_print(ANDROID_LOG_INFO, kTag, "%s enter!", kOp);
-  EseLock lock(g_eseMutex.get(), kOp);
-  if (!lock.held()) {
+  DeviceGate::Pass pass = gate().enter(kOp);
+  if (!pass.ok()) {
     _hidl_cb(hidl_vec<uint8_t>{kMarkerExchangeFailed}, SecureElementStatus::FAILED);
     return Void();
   }
@@ -559,13 +602,39 @@ Return<void> SecureElement::openBasicChannel(const hidl_vec<uint8_t>& aid, uint8
 
 Return<SecureElementStatus> SecureElement::closeChannel(uint8_t channelNumber) {
   static const char* const kOp = "closeChannel";
-  EseLock lock(g_eseMutex.get(), kOp);
-  if (!lock.held()) return SecureElementStatus::FAILED;
-  return closeChannelUnlocked(channelNumber, kOp);
+  // Only a channel this front opened is owed a close once the caller lets go
+  // of it: the caller learns that it was not closed now, and it is closed as
+  // soon as the library can.
+  const bool owed = isLogicalChannelOpen(channelNumber);
+  DeviceGate::Pass pass = gate().enter(kOp);
+  if (!pass.ok()) {
+    if (owed) closeLater(channelNumber, kOp);
+    return SecureElementStatus::FAILED;
+  }
+  const CloseResult r = closeTracked(channelNumber, kOp);
+  if (r == CloseResult::kLibraryFailed && owed) closeLater(channelNumber, kOp);
+  return statusOf(r);
 }
 
 SecureElementStatus SecureElement::internalCloseChannel(uint8_t channelNumber) {
-  return closeChannelUnlocked(channelNumber, "internalCloseChannel");
+  return statusOf(closeTracked(channelNumber, "internalCloseChannel"));
+}
+
+bool SecureElement::releaseLibrary(const char* op) {
+  // The card drops every channel with the close: nothing owed to them is
+  // left to send, and their flags go at the next init's sweep.
+  auto release = [] {
+    (void)lib::close();
+    gate().forgetChannels();
+    return DeviceGate::Outcome::kDone;
+  };
+  DeviceGate::Pass pass = gate().enter(op);
+  if (!pass.ok()) {
+    gate().defer(release, std::string(op) + ", phQvEse_close");
+    return false;
+  }
+  release();
+  return true;
 }
 
 bool SecureElement::isLogicalChannelOpen(uint8_t channelNumber) {
@@ -576,8 +645,15 @@ bool SecureElement::isLogicalChannelOpen(uint8_t channelNumber) {
 void SecureElement::serviceDied(uint64_t /*cookie*/, const wp<IBase>& /*who*/) {
   __android_log_print(ANDROID_LOG_ERROR, kTag, "%s enter!", "serviceDied");
   // Death notices come on a pool thread; one must not wait behind a library
-  // call that may never return.
-  lib::closeNowOrAfterCurrentCall("serviceDied");
+  // call that may never return: the close runs as soon as the library is
+  // free, before any later call.
+  gate().defer(
+      [] {
+        (void)lib::close();
+        gate().forgetChannels();
+        return DeviceGate::Outcome::kDone;
+      },
+      "serviceDied, phQvEse_close");
 }
 
 }  // namespace implementation

@@ -9,6 +9,8 @@
 #include <android/hardware/secure_element/1.0/ISecureElement.h>
 #include <hidl/HidlSupport.h>
 
+class DeviceGate;
+
 namespace android {
 namespace hardware {
 namespace secure_element {
@@ -51,9 +53,14 @@ struct SecureElement : public ISecureElement, public hidl_death_recipient {
 
   void serviceDied(uint64_t cookie, const wp<IBase>& who) override;
 
-  // Closes a logical channel without taking the lock: callers either hold it
-  // already (a failed open) or run beside it on purpose (init).
+  // Closes a logical channel without taking the lock: callers hold it already
+  // (a failed open, init's sweep, a queued close).
   static SecureElementStatus internalCloseChannel(uint8_t channelNumber);
+  // Lets go of the library (phQvEse_close) as soon as it is free, before any
+  // later call; true when that happened now. The card drops every channel.
+  static bool releaseLibrary(const char* op);
+  // The gate every eSE call passes (admission, waiting, queued closes).
+  static DeviceGate& gate();
 
   // Whether logical channel `channelNumber` is held open by this front (its
   // channel table); false for 0, the basic channel, which it does not track.

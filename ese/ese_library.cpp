@@ -1,6 +1,8 @@
 #include "ese_library.h"
 
-#include "ese_library_gate.h"
+#include <time.h>
+
+#include <atomic>
 
 namespace android {
 namespace hardware {
@@ -11,57 +13,61 @@ namespace ese_library {
 
 namespace {
 
-constexpr int32_t kGaveUp = -1;
+// Monotonic time the call now in the library went in, in microseconds; 0
+// when none is in it. Library calls are made one at a time, by the holder of
+// the front's lock.
+std::atomic<int64_t> g_inLibrarySince{0};
 
-LibraryGate& gate() {
-  // Lives as long as the process: a pool thread may still be in the library
-  // when the process exits.
-  static LibraryGate* instance = new LibraryGate(stuckCallBound());
-  return *instance;
+int64_t nowMicros() {
+  struct timespec t;
+  clock_gettime(CLOCK_MONOTONIC, &t);
+  return static_cast<int64_t>(t.tv_sec) * 1000000 + t.tv_nsec / 1000;
 }
 
-// Runs one library call through the gate.
 template <typename Call>
-int32_t gated(const char* op, Call call) {
-  if (!gate().enter(op)) return kGaveUp;
+int32_t timed(Call call) {
+  g_inLibrarySince.store(nowMicros());
   const int32_t rc = call();
-  gate().leave();
+  g_inLibrarySince.store(0);
   return rc;
 }
-
-void closeLibrary() { (void)phQvEse_close(); }
 
 }  // namespace
 
 int32_t initOpen() {
-  return gated("phQvEse_init_open", [] { return phQvEse_init_open(); });
+  return timed([] { return phQvEse_init_open(); });
+}
+
+int32_t close() {
+  return timed([] { return phQvEse_close(); });
 }
 
 int32_t transceive(phQvEse_7816_cpdu* cpdu, phQvEse_7816_rpdu* rpdu) {
-  return gated("phQvEse_7816_Transceive", [&] { return phQvEse_7816_Transceive(cpdu, rpdu); });
+  return timed([&] { return phQvEse_7816_Transceive(cpdu, rpdu); });
 }
 
 int32_t transmitByIpc(phQvEse_data* cmd, phQvEse_data* rsp) {
-  return gated("phQVNciHal_Transmit_APDU_by_IPC",
-               [&] { return phQVNciHal_Transmit_APDU_by_IPC(cmd, rsp); });
+  return timed([&] { return phQVNciHal_Transmit_APDU_by_IPC(cmd, rsp); });
 }
 
 int32_t setReady() {
-  return gated("phQVNciHal_Set_KORVA_READY", [] { return phQVNciHal_Set_KORVA_READY(); });
+  return timed([] { return phQVNciHal_Set_KORVA_READY(); });
 }
 
 int32_t setPower(const char* state) {
-  return gated("phQVNciHal_Set_KORVA_Power", [&] { return phQVNciHal_Set_KORVA_Power(state); });
+  return timed([&] { return phQVNciHal_Set_KORVA_Power(state); });
 }
 
 int32_t readyStatus() {
-  return gated("phQVNciHal_Get_KORVA_Ready_Status",
-               [] { return phQVNciHal_Get_KORVA_Ready_Status(); });
+  return timed([] { return phQVNciHal_Get_KORVA_Ready_Status(); });
 }
 
-void closeNowOrAfterCurrentCall(const char* op) { (void)gate().runOrLeave(closeLibrary, op); }
-
-bool lockFront(pthread_mutex_t* mutex, const char* op) { return gate().lock(mutex, op); }
+int64_t silenceMicros() {
+  const int64_t since = g_inLibrarySince.load();
+  if (since == 0) return 0;
+  const int64_t d = nowMicros() - since;
+  return d > 0 ? d : 1;
+}
 
 }  // namespace ese_library
 }  // namespace implementation

@@ -2,7 +2,12 @@
 
 #include <android/log.h>
 
+#include <errno.h>
+#include <signal.h>
+
 #include <cstdio>
+
+#include "se_device_gate.h"
 
 namespace aidl {
 namespace android {
@@ -94,9 +99,11 @@ bool AidlFront::linkClient(AIBinder* client, const sp<hidl_death_recipient>& rec
   std::lock_guard<std::mutex> g(mLock);
   for (const auto& l : mLinks) {
     // Each init of the same client links again; one notice is enough.
-    if (l->client == client && l->recipient == recipient) return true;
+    if (l->client.get() == client && l->recipient == recipient) return true;
   }
-  auto link = std::make_unique<ClientLink>(ClientLink{this, client, recipient, cookie, who});
+  AIBinder_incStrong(client);
+  auto link = std::make_unique<ClientLink>(
+      ClientLink{this, ::ndk::SpAIBinder(client), se_call::callerPid(), recipient, cookie, who});
   if (AIBinder_linkToDeath(client, mDeath.get(), link.get()) != STATUS_OK) return false;
   mLinks.push_back(std::move(link));
   return true;
@@ -111,6 +118,7 @@ void AidlFront::clientDied(ClientLink* link) {
   sp<hidl_death_recipient> recipient;
   uint64_t cookie = 0;
   wp<IBase> who;
+  std::unique_ptr<ClientLink> gone;
   {
     std::lock_guard<std::mutex> g(mLock);
     for (auto it = mLinks.begin(); it != mLinks.end(); ++it) {
@@ -118,12 +126,12 @@ void AidlFront::clientDied(ClientLink* link) {
       recipient = link->recipient;
       cookie = link->cookie;
       who = link->who;
-      if (mCallback != nullptr && mCallback->asBinder().get() == link->client) {
-        // The basic channel was that client's; the card forgets it with the
-        // element's close that the HIDL front does on a client's death.
-        mCallback = nullptr;
-        mBasicOpen = false;
-      }
+      mCallbacks.erase(link->pid);
+      // The basic channel was that client's; the card forgets it with the
+      // element's close that the HIDL front does on a client's death.
+      pid_t owner = link->pid;
+      mBasicOwner.compare_exchange_strong(owner, 0);
+      gone = std::move(*it);
       mLinks.erase(it);
       break;
     }
@@ -138,10 +146,32 @@ bool AidlFront::bringUp(const std::shared_ptr<ISecureElementCallback>& cb) {
   return r.isOk() && bridge->ready();
 }
 
-bool AidlFront::channelOpen(uint8_t channel) {
-  if (channel == 0) return mBasicOpen;
+pid_t AidlFront::basicOwner() {
+  pid_t owner = mBasicOwner.load();
+  if (owner != 0 && kill(owner, 0) != 0 && errno == ESRCH) {
+    // Its client went without a death link (it never called init).
+    AIDL_LOGI("%s, the basic channel's client %d is gone", mName.c_str(), static_cast<int>(owner));
+    mHidl->closeChannel(0);
+    mBasicOwner.compare_exchange_strong(owner, 0);
+  }
+  return mBasicOwner.load();
+}
+
+bool AidlFront::channelOpen(uint8_t channel, pid_t caller) {
+  if (channel == 0) return mBasicOwner.load() == caller;
   return channel <= kMaxLogicalChannel && mElement.logicalChannelOpen(channel);
 }
+
+// Each call runs as its client: admitted once to the instance (the HIDL
+// calls it makes count with it), the client's process named for channel
+// ownership, and the HIDL front's failures read back.
+#define AIDL_CALL(op)                                                            \
+  se_call::Scope callScope(AIBinder_getCallingPid());                             \
+  std::unique_ptr<DeviceGate::Pass> admission;                                  \
+  if (mElement.gate != nullptr) {                                               \
+    admission = std::make_unique<DeviceGate::Pass>(mElement.gate->admit(op));   \
+    if (!admission->ok()) return error(FAILED, mName + " is busy: " op " refused"); \
+  }
 
 ScopedAStatus AidlFront::init(const std::shared_ptr<ISecureElementCallback>& in_clientCallback) {
   if (in_clientCallback == nullptr) {
@@ -149,9 +179,10 @@ ScopedAStatus AidlFront::init(const std::shared_ptr<ISecureElementCallback>& in_
     mHidl->init(nullptr);
     return ScopedAStatus::fromExceptionCodeWithMessage(EX_NULL_POINTER, "init needs a callback");
   }
+  AIDL_CALL("init");
   {
     std::lock_guard<std::mutex> g(mLock);
-    mCallback = in_clientCallback;
+    mCallbacks[se_call::callerPid()] = in_clientCallback;
   }
   if (!bringUp(in_clientCallback)) {
     AIDL_LOGE("%s, init: the element did not come up", mName.c_str());
@@ -161,24 +192,30 @@ ScopedAStatus AidlFront::init(const std::shared_ptr<ISecureElementCallback>& in_
 }
 
 ScopedAStatus AidlFront::getAtr(std::vector<uint8_t>* _aidl_return) {
+  AIDL_CALL("getAtr");
   bool called = false;
   Return<void> r = mHidl->getAtr([&](const hidl_vec<uint8_t>& atr) {
     *_aidl_return = atr;
     called = true;
   });
-  if (!r.isOk() || !called) return error(FAILED, "getAtr gave no result");
+  if (!r.isOk() || !called || se_call::failed()) {
+    _aidl_return->clear();
+    return error(FAILED, "getAtr failed");
+  }
   return ScopedAStatus::ok();
 }
 
 ScopedAStatus AidlFront::isCardPresent(bool* _aidl_return) {
+  AIDL_CALL("isCardPresent");
   Return<bool> r = mHidl->isCardPresent();
-  if (!r.isOk()) return error(FAILED, "isCardPresent failed");
+  if (!r.isOk() || se_call::failed()) return error(FAILED, "isCardPresent failed");
   *_aidl_return = r;
   return ScopedAStatus::ok();
 }
 
 ScopedAStatus AidlFront::openLogicalChannel(const std::vector<uint8_t>& in_aid, int8_t in_p2,
                                             LogicalChannelResponse* _aidl_return) {
+  AIDL_CALL("openLogicalChannel");
   bool called = false;
   HidlChannelResponse resp;
   SecureElementStatus status = SecureElementStatus::FAILED;
@@ -209,8 +246,10 @@ ScopedAStatus AidlFront::openLogicalChannel(const std::vector<uint8_t>& in_aid, 
 
 ScopedAStatus AidlFront::openBasicChannel(const std::vector<uint8_t>& in_aid, int8_t in_p2,
                                           std::vector<uint8_t>* _aidl_return) {
+  AIDL_CALL("openBasicChannel");
+  const pid_t caller = se_call::callerPid();
   std::lock_guard<std::mutex> g(mBasicLock);
-  if (mBasicOpen) return error(CHANNEL_NOT_AVAILABLE, "the basic channel is already open");
+  if (basicOwner() != 0) return error(CHANNEL_NOT_AVAILABLE, "the basic channel is already open");
   bool called = false;
   std::vector<uint8_t> select;
   SecureElementStatus status = SecureElementStatus::FAILED;
@@ -226,7 +265,7 @@ ScopedAStatus AidlFront::openBasicChannel(const std::vector<uint8_t>& in_aid, in
     return errorOf(status, "openBasicChannel: " + toString(status));
   }
   if (select.size() < 2) return error(FAILED, "the select response has no status word");
-  mBasicOpen = true;
+  mBasicOwner = caller;
   *_aidl_return = std::move(select);
   return ScopedAStatus::ok();
 }
@@ -241,7 +280,8 @@ ScopedAStatus AidlFront::transmit(const std::vector<uint8_t>& in_data,
   if (channel < 0) {
     return ScopedAStatus::fromExceptionCodeWithMessage(EX_ILLEGAL_ARGUMENT, "CLA FF is invalid");
   }
-  if (!channelOpen(static_cast<uint8_t>(channel))) {
+  AIDL_CALL("transmit");
+  if (!channelOpen(static_cast<uint8_t>(channel), se_call::callerPid())) {
     return error(CHANNEL_NOT_AVAILABLE, "channel " + std::to_string(channel) + " is not open");
   }
   std::vector<uint8_t> response;
@@ -249,7 +289,7 @@ ScopedAStatus AidlFront::transmit(const std::vector<uint8_t>& in_data,
       mHidl->transmit(in_data, [&](const hidl_vec<uint8_t>& rsp) { response = rsp; });
   // Fewer than two bytes hold no status word: the exchange failed (the eSE
   // front's marker byte, the SIM front's empty answer).
-  if (!r.isOk() || response.size() < 2) {
+  if (!r.isOk() || response.size() < 2 || se_call::failed()) {
     return error(CHANNEL_NOT_AVAILABLE, "the exchange on channel " + std::to_string(channel) +
                                             " failed");
   }
@@ -258,17 +298,20 @@ ScopedAStatus AidlFront::transmit(const std::vector<uint8_t>& in_data,
 }
 
 ScopedAStatus AidlFront::closeChannel(int8_t in_channelNumber) {
+  AIDL_CALL("closeChannel");
   const int channel = static_cast<uint8_t>(in_channelNumber);
   if (channel == 0) {
     std::lock_guard<std::mutex> g(mBasicLock);
-    if (!mBasicOpen) return error(FAILED, "the basic channel is not open");
+    if (mBasicOwner.load() != se_call::callerPid()) {
+      return error(FAILED, "the basic channel is not open");
+    }
     // Nothing to send for the basic channel; the HIDL front's close of it
     // only powers the element down as after every close.
     mHidl->closeChannel(0);
-    mBasicOpen = false;
+    mBasicOwner = 0;
     return ScopedAStatus::ok();
   }
-  if (!channelOpen(static_cast<uint8_t>(channel))) {
+  if (!channelOpen(static_cast<uint8_t>(channel), se_call::callerPid())) {
     return error(FAILED, "channel " + std::to_string(channel) + " is not open");
   }
   Return<SecureElementStatus> r = mHidl->closeChannel(static_cast<uint8_t>(channel));
@@ -281,23 +324,34 @@ ScopedAStatus AidlFront::closeChannel(int8_t in_channelNumber) {
 }
 
 ScopedAStatus AidlFront::reset() {
+  AIDL_CALL("reset");
   std::shared_ptr<ISecureElementCallback> cb;
   {
     std::lock_guard<std::mutex> g(mLock);
-    cb = mCallback;
+    auto it = mCallbacks.find(se_call::callerPid());
+    if (it != mCallbacks.end()) cb = it->second;
   }
   if (cb == nullptr) return error(FAILED, "reset needs an init first");
 
-  // Every open channel goes, whoever opened it: the element starts afresh.
+  // Every open channel goes, whoever opened it: the element starts afresh. A
+  // close the element cannot make now is queued by the front; the reset then
+  // fails, as its closes have not run yet.
+  bool closed = true;
   for (uint8_t c = 1; c <= kMaxLogicalChannel; ++c) {
-    if (mElement.logicalChannelOpen(c)) mHidl->closeChannel(c);
+    if (!mElement.logicalChannelOpen(c)) continue;
+    se_call::Scope one(se_call::callerPid());
+    mHidl->closeChannel(c);
+    if (se_call::failed()) closed = false;
   }
   {
     std::lock_guard<std::mutex> g(mBasicLock);
-    if (mBasicOpen) mHidl->closeChannel(0);
-    mBasicOpen = false;
+    if (mBasicOwner.load() != 0) mHidl->closeChannel(0);
+    mBasicOwner = 0;
   }
-  mElement.release();
+  if (!closed || !mElement.release()) {
+    AIDL_LOGE("%s, reset: the element is busy, its closes are queued", mName.c_str());
+    return error(FAILED, mName + " is busy: the reset's closes are queued");
+  }
   ScopedAStatus st = cb->onStateChange(false, mName + " is being reset");
   if (!st.isOk()) AIDL_LOGE("%s, reset: onStateChange: %s", mName.c_str(), st.getDescription().c_str());
   if (!bringUp(cb)) {

@@ -9,10 +9,15 @@
 #include <atomic>
 #include <functional>
 #include <list>
+#include <map>
 #include <memory>
 #include <mutex>
 #include <string>
 #include <vector>
+
+#include <sys/types.h>
+
+class DeviceGate;
 
 namespace aidl {
 namespace android {
@@ -27,8 +32,12 @@ class AidlFront : public BnSecureElement {
   struct Element {
     // Whether logical channel 1..19 is open, as the front's own table says.
     std::function<bool(uint8_t channel)> logicalChannelOpen;
-    // Lets go of the element before reset brings it up again.
-    std::function<void()> release;
+    // Lets go of the element before reset brings it up again; false when
+    // that could not be done now (it is then queued).
+    std::function<bool()> release;
+    // The instance's gate: an AIDL call is admitted once for all the HIDL
+    // calls it makes. Null: no admission of its own.
+    DeviceGate* gate = nullptr;
   };
 
   AidlFront(::android::sp<HidlSecureElement> hidl, std::string name, Element element);
@@ -56,7 +65,10 @@ class AidlFront : public BnSecureElement {
  private:
   struct ClientLink {
     AidlFront* front;
-    AIBinder* client;  // identity only; the link ends with the client
+    // Held, so that its address cannot stand for another client while the
+    // link lasts; the link ends with the client.
+    ::ndk::SpAIBinder client;
+    pid_t pid;
     ::android::sp<::android::hardware::hidl_death_recipient> recipient;
     uint64_t cookie;
     ::android::wp<::android::hidl::base::V1_0::IBase> who;
@@ -67,7 +79,11 @@ class AidlFront : public BnSecureElement {
   // Brings the element up through the HIDL front's init with `cb` behind
   // it; true when the front reported it ready.
   bool bringUp(const std::shared_ptr<ISecureElementCallback>& cb);
-  bool channelOpen(uint8_t channel);
+  // Whether `channel` is open for the calling client: the basic channel only
+  // for the client that opened it.
+  bool channelOpen(uint8_t channel, pid_t caller);
+  // The basic channel's owner, after letting go of one whose process is gone.
+  pid_t basicOwner();
 
   const ::android::sp<HidlSecureElement> mHidl;
   const std::string mName;
@@ -75,13 +91,15 @@ class AidlFront : public BnSecureElement {
   ::ndk::ScopedAIBinder_DeathRecipient mDeath;
 
   std::mutex mLock;  // guards what follows; never held across a call out
-  std::shared_ptr<ISecureElementCallback> mCallback;  // the last init's
+  // Each client's callback from its last init, by process.
+  std::map<pid_t, std::shared_ptr<ISecureElementCallback>> mCallbacks;
   std::list<std::unique_ptr<ClientLink>> mLinks;
 
   // The HIDL fronts do not track the basic channel; this face does, for
-  // its clients. Held across a basic open or close so that two cannot race.
+  // its clients: it belongs to the process that opened it (0: closed).
+  // Held across a basic open or close so that two cannot race.
   std::mutex mBasicLock;
-  std::atomic<bool> mBasicOpen{false};
+  std::atomic<pid_t> mBasicOwner{0};
 };
 
 }  // namespace secure_element

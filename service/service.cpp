@@ -14,6 +14,7 @@
 #include "ZerbSimSecureElement.h"
 #include "aidl_front.h"
 #include "ese_qv_hal.h"
+#include "se_device_gate.h"
 
 using ::android::OK;
 using ::android::sp;
@@ -26,10 +27,12 @@ using AidlISecureElement = ::aidl::android::hardware::secure_element::ISecureEle
 
 namespace {
 constexpr const char* kTag = "qvese@1.0-service";
-constexpr size_t kRpcThreads = 2;
-// Binder threads the driver may add beside the one the pool starts with: two
-// for AIDL calls, as the HIDL pool has. (On a host both share one pool.)
-constexpr uint32_t kAidlExtraThreads = 1;
+// Each pool has a thread more than either instance may take (see the gate in
+// se_device_gate.h), so a stuck device never holds every thread.
+constexpr size_t kRpcThreads = kRpcPoolThreads;
+// Binder threads the driver may add beside the one the pool starts with: as
+// many AIDL threads as the HIDL pool has. (On a host both share one pool.)
+constexpr uint32_t kAidlExtraThreads = kRpcPoolThreads - 1;
 
 // Serves `front` as the AIDL instance `instance`; false (logged) on failure.
 bool registerAidl(const std::shared_ptr<AidlFront>& front, const char* instance) {
@@ -80,13 +83,17 @@ int qvese_service_main() {
   if (ese != nullptr) {
     aidlEse = ::ndk::SharedRefBase::make<AidlFront>(
         ese, "eSE1",
-        AidlFront::Element{SecureElement::isLogicalChannelOpen, [] { phQvEse_close(); }});
+        AidlFront::Element{SecureElement::isLogicalChannelOpen,
+                           [] { return SecureElement::releaseLibrary("reset"); },
+                           &SecureElement::gate()});
     if (!registerAidl(aidlEse, "eSE1")) return 1;
   }
   // The SIM's channels are closed on the modem by the reset itself; the
   // modem's port stays open.
   auto aidlSim = ::ndk::SharedRefBase::make<AidlFront>(
-      sim, "SIM1", AidlFront::Element{ZerbSimSecureElement::isChannelOpen, [] {}});
+      sim, "SIM1",
+      AidlFront::Element{ZerbSimSecureElement::isChannelOpen, [] { return true; },
+                         &ZerbSimSecureElement::gate()});
   if (!registerAidl(aidlSim, "SIM1")) return 1;
   ABinderProcess_startThreadPool();
 

@@ -4,13 +4,16 @@
 #include <securec.h>
 #include <errno.h>
 
+#include <string>
+
 #include "async_cmd.h"
 #include "modem_select.h"
 #include "se_delay.h"
 #include "se_modem_id.h"
 #include "se_uptime.h"
+#include "se_device_gate.h"
 
-uint8_t g_simOpenedChannels[SIM_CHANNEL_MAX];
+std::atomic<uint8_t> g_simOpenedChannels[SIM_CHANNEL_MAX];
 std::atomic<int32_t> timeflag{-1};
 
 namespace android {
@@ -24,13 +27,6 @@ constexpr const char* kTag = "ZerbSimSecureElement";
 // Settling time the modem needs after boot before the first request.
 constexpr uint64_t kSettleMicros = 1500000;
 constexpr long kSettledUptimeSeconds = 120;
-// How long a SIM call waits for the front's lock while the call holding it
-// has a modem command out with no answer line. A working modem answers an
-// AT command within about 200 ms; half a second without a line means the
-// modem has gone silent, and the waiter gives up so that its RPC thread is
-// free for the eSE and for death notices. While answers keep coming the
-// waiter keeps waiting, however long the holder's exchange takes.
-constexpr int64_t kModemSilenceMicros = 500000;
 }  // namespace
 
 #define SIM_LOGD(...) __android_log_buf_print(LOG_ID_RADIO, ANDROID_LOG_DEBUG, kTag, __VA_ARGS__)
@@ -49,52 +45,6 @@ ZerbThreadMutex::~ZerbThreadMutex() { pthread_mutex_destroy(&m_mutex); }
 static ZerbThreadMutex g_simMutex;
 
 namespace {
-
-// Takes g_simMutex, waiting only while the holder's modem is working (see
-// kModemSilenceMicros). False, with a log line, when it gave up.
-bool lockUnlessModemSilent(const char* operation) {
-  if (pthread_mutex_trylock(g_simMutex.get()) == 0) return true;
-  const int64_t bound = static_cast<int64_t>(se_delay::scaledMicros(kModemSilenceMicros));
-  for (;;) {
-    int64_t silent = asyncCmdSilenceMicros();
-    if (silent >= bound) {
-      SIM_LOGE("%s, modem silent for %lld ms, SIM busy: call given up", operation,
-               static_cast<long long>(silent / 1000));
-      return false;
-    }
-    // Sleep on the lock until the modem would count as silent; answers
-    // that come meanwhile move that moment on. The deadline is on the
-    // wall clock, as the lock's timed wait wants, and is taken afresh
-    // each round, so a clock change costs at most one round.
-    int64_t wait = bound - silent;
-    struct timespec deadline;
-    clock_gettime(CLOCK_REALTIME, &deadline);
-    int64_t nsec = deadline.tv_nsec + (wait % 1000000) * 1000;
-    deadline.tv_sec += static_cast<time_t>(wait / 1000000 + nsec / 1000000000);
-    deadline.tv_nsec = static_cast<long>(nsec % 1000000000);
-    int rc = pthread_mutex_timedlock(g_simMutex.get(), &deadline);
-    if (rc == 0) return true;
-    if (rc != ETIMEDOUT) {
-      SIM_LOGE("%s, SIM lock failed: %d", operation, rc);
-      return false;
-    }
-  }
-}
-
-// Holds g_simMutex for one scope, when it could be had (see held()).
-class SimLock {
- public:
-  explicit SimLock(const char* operation) : held_(lockUnlessModemSilent(operation)) {}
-  ~SimLock() {
-    if (held_) pthread_mutex_unlock(g_simMutex.get());
-  }
-  SimLock(const SimLock&) = delete;
-  SimLock& operator=(const SimLock&) = delete;
-  bool held() const { return held_; }
-
- private:
-  const bool held_;
-};
 
 hidl_vec<uint8_t> bytesOf(const uint8_t* data, int32_t count) {
   hidl_vec<uint8_t> out;
@@ -121,7 +71,47 @@ void settleAfterBoot() {
   SIM_LOGD("%s, SLEEP 1.5S", "init");
 }
 
+// The modem for this call, made current; called with the front's lock held.
+int32_t currentModem(const char* operation) {
+  int32_t modem = communication_which_modem();
+  if (modem < 0) {
+    SIM_LOGE("%s, modem_id error: %d", operation, modem);
+    modem = 0;
+  }
+  SIM_LOGD("%s, modem_id: %d", operation, modem);
+  g_ulModemId = modem;
+  return modem;
+}
+
+// Request 6 for `channel` on the current modem, with the front's lock held.
+// The flag goes whatever the modem answered: a release the modem could not
+// take now is the request engine's to repeat (it keeps the session until the
+// modem has released it), so the front has nothing left to retry.
+SecureElementStatus closeOnModem(int32_t modem, uint8_t channel) {
+  SecureElementStatus status = SecureElementStatus::FAILED;
+  g_asyncCmd.param = static_cast<int32_t>(channel);
+  if (asyncCmdPush(modem, REQUEST_CLOSE_LOGICAL_CHANNEL, nullptr, 0) == 0) {
+    status = static_cast<SecureElementStatus>(g_asyncCmd.param & 0xFF);
+  }
+  if (channel < SIM_CHANNEL_MAX) g_simOpenedChannels[channel] = 0;
+  ZerbSimSecureElement::gate().closed(channel);
+  return status;
+}
+
+DeviceGate::Outcome closeQueued(uint8_t channel) {
+  (void)closeOnModem(currentModem("closeChannel"), channel);
+  return DeviceGate::Outcome::kDone;
+}
+
 }  // namespace
+
+DeviceGate& ZerbSimSecureElement::gate() {
+  // Lives as long as the process: a pool thread may still wait on it at exit.
+  static DeviceGate* instance = new DeviceGate(DeviceGate::Config{
+      "SIM1", LOG_ID_RADIO, kTag, g_simMutex.get(), kCallersPerInstance,
+      "vendor.secure_element.sim.hang_ms", asyncCmdSilenceMicros, closeQueued});
+  return *instance;
+}
 
 ZerbSimSecureElement::ZerbSimSecureElement(int modemId) {
   SIM_LOGD("%s, modemid %d", "ZerbSimSecureElement", modemId);
@@ -132,14 +122,7 @@ ZerbSimSecureElement::~ZerbSimSecureElement() {}
 
 // Picks the modem for this call and makes it current. Called under g_simMutex.
 void ZerbSimSecureElement::selectModem(const char* operation) {
-  int32_t modem = communication_which_modem();
-  if (modem < 0) {
-    SIM_LOGE("%s, modem_id error: %d", operation, modem);
-    modem = 0;
-  }
-  m_modem_id = modem;
-  SIM_LOGD("%s, modem_id: %d", operation, modem);
-  g_ulModemId = modem;
+  m_modem_id = currentModem(operation);
 }
 
 Return<void> ZerbSimSecureElement::init(const sp<ISecureElementHalCallback>& clientCallback) {
@@ -149,19 +132,15 @@ Return<void> ZerbSimSecureElement::init(const sp<ISecureElementHalCallback>& cli
     SIM_LOGE("%s, clientCallback is NULL", "init");
     return Void();
   }
-  (void)clientCallback->linkToDeath(this, 0);
+  DeviceGate::Pass pass = gate().admit("init");
+  if (!pass.ok()) return Void();
+  // The cookie names the client, so that its death closes its channels.
+  (void)clientCallback->linkToDeath(this, static_cast<uint64_t>(se_call::callerPid()));
 
-  // Channels 1 and 2 are left alone: the sweep starts at 3.
-  // A silent modem ends the sweep: its closes could not be sent anyway, and
-  // the flags stay for the next init.
+  // Channels 1 and 2 are left alone: the sweep starts at 3. A close that
+  // cannot be made now is queued by closeChannel and made later.
   for (uint8_t channel = 3; channel < SIM_CHANNEL_MAX; channel++) {
-    bool opened;
-    {
-      SimLock lock("init");
-      if (!lock.held()) break;
-      opened = g_simOpenedChannels[channel] != 0;
-    }
-    if (opened) (void)closeChannel(channel);
+    if (g_simOpenedChannels[channel] != 0) (void)closeChannel(channel);
   }
 
   int32_t dualSim = judge_dual_sim();
@@ -186,36 +165,47 @@ Return<void> ZerbSimSecureElement::init(const sp<ISecureElementHalCallback>& cli
 }
 
 Return<void> ZerbSimSecureElement::getAtr(getAtr_cb _hidl_cb) {
-  SimLock lock("getAtr");
+  DeviceGate::Pass pass = gate().enter("getAtr");
   hidl_vec<uint8_t> atr;
-  if (!lock.held()) {
+  if (!pass.ok()) {
     _hidl_cb(atr);
     return Void();
   }
   selectModem("getAtr");
   if (asyncCmdPush(m_modem_id, REQUEST_GET_ATR, nullptr, 0) == 0) {
     SIM_LOGD("%s, now copy data, modem_id: %d", "getAtr", m_modem_id.load());
-    if (g_asyncCmd.datalen >= 1 && g_asyncCmd.datalen <= ASYNC_CMD_DATA_MAX) atr = bytesOf(g_asyncCmd.data, g_asyncCmd.datalen);
+    if (g_asyncCmd.datalen >= 1 && g_asyncCmd.datalen <= ASYNC_CMD_DATA_MAX) {
+      atr = bytesOf(g_asyncCmd.data, g_asyncCmd.datalen);
+    } else if (g_asyncCmd.param != 0 || g_asyncCmd.datalen < 0) {
+      // No ATR from a modem that should give one; an empty one given
+      // deliberately (param 0, length 0) is an answer.
+      se_call::markFailed();
+    }
+  } else {
+    se_call::markFailed();
   }
   _hidl_cb(atr);
   return Void();
 }
 
 Return<bool> ZerbSimSecureElement::isCardPresent() {
-  SimLock lock("isCardPresent");
-  if (!lock.held()) return false;
+  DeviceGate::Pass pass = gate().enter("isCardPresent");
+  if (!pass.ok()) return false;
   selectModem("isCardPresent");
   bool present = false;
   if (asyncCmdPush(m_modem_id, REQUEST_GET_CARD_PRESENT, nullptr, 0) == 0) {
     present = g_asyncCmd.param > 0;
+    if (g_asyncCmd.param < 0) se_call::markFailed();
+  } else {
+    se_call::markFailed();
   }
   return present;
 }
 
 Return<void> ZerbSimSecureElement::transmit(const hidl_vec<uint8_t>& data, transmit_cb _hidl_cb) {
-  SimLock lock("transmit");
+  DeviceGate::Pass pass = gate().enter("transmit");
   hidl_vec<uint8_t> response;
-  if (!lock.held()) {
+  if (!pass.ok()) {
     _hidl_cb(response);
     return Void();
   }
@@ -229,16 +219,17 @@ Return<void> ZerbSimSecureElement::transmit(const hidl_vec<uint8_t>& data, trans
       response = bytesOf(g_asyncCmd.data, g_asyncCmd.datalen);
     }
   }
+  if (response.size() == 0) se_call::markFailed();
   _hidl_cb(response);
   return Void();
 }
 
 Return<void> ZerbSimSecureElement::openLogicalChannel(const hidl_vec<uint8_t>& aid, uint8_t p2,
                                                       openLogicalChannel_cb _hidl_cb) {
-  SimLock lock("openLogicalChannel");
+  DeviceGate::Pass pass = gate().enter("openLogicalChannel");
   LogicalChannelResponse response;
   SecureElementStatus status = SecureElementStatus::FAILED;
-  if (!lock.held()) {
+  if (!pass.ok()) {
     _hidl_cb(response, status);
     return Void();
   }
@@ -252,7 +243,10 @@ Return<void> ZerbSimSecureElement::openLogicalChannel(const hidl_vec<uint8_t>& a
       status = static_cast<SecureElementStatus>(code);
     } else {
       uint8_t channel = g_asyncCmd.data[0];
-      if (channel < SIM_CHANNEL_MAX) g_simOpenedChannels[channel] = 1;
+      if (channel < SIM_CHANNEL_MAX) {
+        g_simOpenedChannels[channel] = 1;
+        gate().opened(channel, se_call::callerPid());
+      }
       response.channelNumber = channel;
       if (g_asyncCmd.datalen >= 1 && g_asyncCmd.datalen <= ASYNC_CMD_SELECT_RESP_MAX) {
         response.selectResponse = bytesOf(g_asyncCmd.data + 1, g_asyncCmd.datalen);
@@ -272,28 +266,31 @@ Return<void> ZerbSimSecureElement::openBasicChannel(const hidl_vec<uint8_t>&, ui
 }
 
 Return<SecureElementStatus> ZerbSimSecureElement::closeChannel(uint8_t channelNumber) {
-  // Given up, the channel stays flagged: it was not closed.
-  SimLock lock("closeChannel");
-  if (!lock.held()) return SecureElementStatus::FAILED;
-  selectModem("closeChannel");
-  SecureElementStatus status = SecureElementStatus::FAILED;
-  g_asyncCmd.param = static_cast<int32_t>(channelNumber);
-  if (asyncCmdPush(m_modem_id, REQUEST_CLOSE_LOGICAL_CHANNEL, nullptr, 0) == 0) {
-    status = static_cast<SecureElementStatus>(g_asyncCmd.param & 0xFF);
+  DeviceGate::Pass pass = gate().enter("closeChannel");
+  if (!pass.ok()) {
+    // The caller no longer holds the channel: it is closed as soon as the
+    // modem is free, and the caller learns that it was not closed now.
+    gate().defer([channelNumber] { return closeQueued(channelNumber); },
+                 "closeChannel " + std::to_string(channelNumber));
+    return SecureElementStatus::FAILED;
   }
-  if (channelNumber < SIM_CHANNEL_MAX) g_simOpenedChannels[channelNumber] = 0;
-  return status;
+  return closeHeld(channelNumber, "closeChannel");
+}
+
+SecureElementStatus ZerbSimSecureElement::closeHeld(uint8_t channelNumber, const char* operation) {
+  selectModem(operation);
+  return closeOnModem(m_modem_id, channelNumber);
 }
 
 bool ZerbSimSecureElement::isChannelOpen(uint8_t channelNumber) {
-  if (channelNumber >= SIM_CHANNEL_MAX) return false;
-  // Behind a silent modem the caller's operation could not run anyway.
-  SimLock lock("isChannelOpen");
-  return lock.held() && g_simOpenedChannels[channelNumber] != 0;
+  return channelNumber < SIM_CHANNEL_MAX && g_simOpenedChannels[channelNumber] != 0;
 }
 
-void ZerbSimSecureElement::serviceDied(uint64_t, const wp<IBase>&) {
+void ZerbSimSecureElement::serviceDied(uint64_t cookie, const wp<IBase>&) {
   SIM_LOGD("%s, enter, modem_id: %d", "serviceDied", m_modem_id.load());
+  // The channels the dead client opened are closed as soon as the modem is
+  // free; a death notice never waits for it.
+  if (cookie != 0) gate().clientDied(static_cast<pid_t>(cookie));
 }
 
 }  // namespace implementation

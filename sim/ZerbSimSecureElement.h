@@ -10,10 +10,13 @@
 #include <android/hardware/secure_element/1.0/ISecureElement.h>
 #include <hidl/HidlSupport.h>
 
+class DeviceGate;
+
 // Logical channels 0 to 19 opened through the SIM front and not closed
-// through it; guarded by the front's lock.
+// through it; written under the front's lock, read without it (the AIDL
+// face asks before every call and must not wait behind a slow modem).
 #define SIM_CHANNEL_MAX 20
-extern uint8_t g_simOpenedChannels[SIM_CHANNEL_MAX];
+extern std::atomic<uint8_t> g_simOpenedChannels[SIM_CHANNEL_MAX];
 // 1 once an init found the system up for 120 s or more; -1 before.
 extern std::atomic<int32_t> timeflag;
 
@@ -61,11 +64,15 @@ struct ZerbSimSecureElement : public ISecureElement, public hidl_death_recipient
   int modemId() const { return m_modem_id.load(); }
 
   // Whether `channelNumber` was opened through this front and not closed
-  // through it (g_simOpenedChannels, read under the front's lock).
+  // through it (g_simOpenedChannels).
   static bool isChannelOpen(uint8_t channelNumber);
+  // The gate every SIM call passes (admission, waiting, queued closes).
+  static DeviceGate& gate();
 
  private:
   void selectModem(const char* operation);
+  // closeChannel's work, with the front's lock held.
+  SecureElementStatus closeHeld(uint8_t channelNumber, const char* operation);
 
   // Written under the front's lock, read without it by init and serviceDied.
   std::atomic<int32_t> m_modem_id;

@@ -1,4 +1,5 @@
 #include "async_cmd.h"
+#include "session_release.h"
 
 #include <errno.h>
 #include <fcntl.h>
@@ -212,10 +213,16 @@ bool serve(AsyncCmdChannel* ch, int32_t id, bool watchPort) {
         atPortOpened[id] = 0;
         return true;
       }
+      // Sessions a release missed are released once the modem answers
+      // again, whether or not a request comes.
+      if (session_release_count(id) > 0) session_release_pending(id);
       (void)waitOnChannel(ch, deadlineIn(kPortCheckMicros));
     }
     if (ch->running == 0) return false;
     QV_LOGD("%s, deal command=%d,%d", "cmdloop", g_asyncCmd.request, id);
+    // Owed releases go first: a new open must not meet a session the
+    // modem still holds for a channel that was given up.
+    session_release_pending(id);
     ch->handler();
     g_asyncCmd.modem_id = id;
     g_asyncCmd.state = CMD_STATE_RESPONSE;
@@ -355,9 +362,10 @@ void cmdloop(AsyncCmdChannel* channel) {
 
     QV_LOGE("%s[%d] AT port lost, channels closed; reopening", "cmdloop", id);
     at_close();
-    // The channels of a lost port are gone with it: the modem forgets its
-    // sessions when its port goes away.
-    clear_session_table(id);
+    // The channels of a lost port are gone for the clients. The modem may
+    // still hold their sessions (a USB modem keeps them when only its
+    // port went away): they are released once the port is back.
+    session_release_all(id);
     fd = waitForPort(channel, id);
     if (fd < 1) break;
   }

@@ -7,6 +7,7 @@
 #include <cstring>
 
 #include "async_cmd.h"
+#include "session_release.h"
 #include "qv_log.h"
 
 int32_t sessionTable[ASYNC_CMD_MODEM_MAX][SESSION_TABLE_SIZE];
@@ -16,7 +17,6 @@ namespace {
 
 constexpr size_t kOpenCmdSize = 120;
 constexpr size_t kTransmitCmdSize = 600;
-constexpr size_t kCloseCmdSize = 32;
 // Both open commands begin with 9 characters: AT+CCHO=" or AT+CCHP=".
 constexpr size_t kOpenCmdPrefixLen = 9;
 constexpr int32_t kAidMaxLen = 52;
@@ -83,23 +83,6 @@ bool readHexAnswer(const char* fn, char* line, const char** hex, int32_t* n) {
   // longer one is lowered to the text's length.
   *n = responseLength < 0 ? responseLength : static_cast<int32_t>(textLen);
   return true;
-}
-
-// Releases a modem channel that the framework will never see, so that a
-// failed open does not keep one of the card's few channels busy.
-bool closeModemSession(const char* fn, int32_t session) {
-  char cmd[kCloseCmdSize];
-  (void)memset_s(cmd, sizeof(cmd), 0, sizeof(cmd));
-  if (snprintf_s(cmd, sizeof(cmd), sizeof(cmd) - 1, "AT+CCHC=%d", session) < 1) return false;
-  ResponseHolder response;
-  int32_t err = at_send_command(cmd, response.out());
-  bool closed = err >= 0 && response.get() != nullptr && response.get()->success != 0;
-  if (closed) {
-    QV_LOGI("%s, released modem session %d", fn, session);
-  } else {
-    QV_LOGE("%s, release of modem session %d failed", fn, session);
-  }
-  return closed;
 }
 
 // The SELECT by AID on the new session. Returns the status of the open;
@@ -315,7 +298,9 @@ void request_open_logical_channel(void) {
   if (channel == 0 || channel >= SESSION_TABLE_SIZE) {
     QV_LOGE("%s, modem channel %d is invalid", kFn, channel);
     // An id below 1 names no channel the modem could close.
-    if (sessionId >= 1) (void)closeModemSession(kFn, sessionId);
+    if (sessionId >= 1 && session_release_now(kFn, sessionId) < 0) {
+      session_release_later(get_ac_index(), sessionId);
+    }
     g_asyncCmd.param = 1;
     return;
   }
@@ -324,8 +309,13 @@ void request_open_logical_channel(void) {
 
   bool portAnswers = true;
   int32_t status = transmit_select_cmd(channel, aidLen, selectP2, openCmd, &portAnswers);
-  if (status != 0 && portAnswers && closeModemSession(kFn, sessionId)) {
-    curSessionTable[channel] = 0;
+  if (status != 0) {
+    // A SELECT the modem did not answer leaves the session to release once
+    // it answers again; waiting for it now would only time out as well. A
+    // release the modem refuses keeps the entry for a later close.
+    const int32_t released = portAnswers ? session_release_now(kFn, sessionId) : -1;
+    if (released < 0) session_release_later(get_ac_index(), sessionId);
+    if (released != 0) curSessionTable[channel] = 0;
   }
   g_asyncCmd.param = status;
 }
@@ -357,6 +347,9 @@ void request_close_logical_channel(void) {
   int32_t err = at_send_command(cmd, response.out());
   if (err < 0 || response.get() == nullptr) {
     QV_LOGE("%s, at send fail", kFn);
+    // Not answered: the channel is gone for the client, the release is owed.
+    session_release_later(get_ac_index(), session);
+    curSessionTable[channel] = 0;
     g_asyncCmd.param = 1;
     return;
   }

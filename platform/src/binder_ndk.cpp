@@ -117,42 +117,64 @@ AIBinder* AIBinder_Weak_promote(AIBinder_Weak* w) {
 
 }  // extern "C"
 
-// A recipient's notices go through its shared state, so that deleting the
-// recipient stops them even while the host still holds its links.
+// A recipient's links and notices live in its shared state, so that
+// deleting the recipient stops its notices even while a host thread is
+// about to run one. A link is keyed by the proxy's serial, not its address:
+// a freed proxy's address may come back as another proxy's.
 struct AIBinder_DeathRecipient {
-  struct State {
-    std::mutex lock;
-    AIBinder_DeathRecipient_onBinderDied onDied = nullptr;
-  };
   struct Link {
-    AIBinder* binder;
+    uint64_t binder;  // the proxy's serial
     void* cookie;
     sp<::android::hardware::hidl_death_recipient> notice;
+    std::weak_ptr<RemotePeer> peer;
+  };
+  struct State {
+    std::mutex lock;  // held while a notice runs
+    AIBinder_DeathRecipient_onBinderDied onDied = nullptr;
+    std::mutex linksLock;  // never held while taking `lock`
+    std::vector<Link> links;
   };
   std::shared_ptr<State> state = std::make_shared<State>();
-  std::mutex linksLock;
-  std::vector<Link> links;
 };
 
 namespace {
 
 class DeathNotice : public ::android::hardware::hidl_death_recipient {
  public:
-  DeathNotice(std::shared_ptr<AIBinder_DeathRecipient::State> state, void* cookie)
+  explicit DeathNotice(std::shared_ptr<AIBinder_DeathRecipient::State> state, void* cookie)
       : mState(std::move(state)), mCookie(cookie) {}
   void serviceDied(uint64_t, const wp<IBase>&) override {
+    // The link goes with the death; one unlinked meanwhile tells nothing.
+    sp<::android::hardware::hidl_death_recipient> self;  // the table's, dropped after the notice
+    {
+      std::lock_guard<std::mutex> g(mState->linksLock);
+      auto& links = mState->links;
+      auto it = std::find_if(links.begin(), links.end(), [&](const AIBinder_DeathRecipient::Link& l) {
+        return l.notice.get() == this;
+      });
+      if (it == links.end()) return;
+      self = it->notice;
+      links.erase(it);
+    }
     // Held while the notice runs: a recipient deleted meanwhile waits for it.
     std::lock_guard<std::mutex> g(mState->lock);
     if (mState->onDied != nullptr) mState->onDied(mCookie);
   }
 
  private:
-  std::shared_ptr<AIBinder_DeathRecipient::State> mState;
-  void* mCookie;
+  const std::shared_ptr<AIBinder_DeathRecipient::State> mState;
+  void* const mCookie;
 };
 
 ProxyBase* proxyOf(const AIBinder* b) {
   return b != nullptr ? dynamic_cast<ProxyBase*>(const_cast<AIBinder*>(b)) : nullptr;
+}
+
+// Takes `link` out of its connection's table.
+void unlinkFromPeer(const AIBinder_DeathRecipient::Link& link) {
+  if (std::shared_ptr<RemotePeer> peer = link.peer.lock()) {
+    peer->unlinkToDeath(link.notice, link.binder);
+  }
 }
 
 }  // namespace
@@ -172,6 +194,13 @@ void AIBinder_DeathRecipient_delete(AIBinder_DeathRecipient* r) {
     std::lock_guard<std::mutex> g(r->state->lock);
     r->state->onDied = nullptr;
   }
+  // As on the platform, its links go with it.
+  std::vector<AIBinder_DeathRecipient::Link> links;
+  {
+    std::lock_guard<std::mutex> g(r->state->linksLock);
+    links.swap(r->state->links);
+  }
+  for (const auto& l : links) unlinkFromPeer(l);
   delete r;
 }
 
@@ -180,11 +209,22 @@ binder_status_t AIBinder_linkToDeath(AIBinder* binder, AIBinder_DeathRecipient* 
   ProxyBase* proxy = proxyOf(binder);
   if (proxy == nullptr) return STATUS_INVALID_OPERATION;  // a local object never dies alone
   sp<::android::hardware::hidl_death_recipient> notice = new DeathNotice(r->state, cookie);
-  if (!proxy->peer()->linkToDeath(notice, 0, wp<IBase>(static_cast<IBase*>(binder)))) {
+  // In the recipient's table first: a death right after the link finds it.
+  {
+    std::lock_guard<std::mutex> g(r->state->linksLock);
+    r->state->links.push_back({proxy->serial(), cookie, notice, proxy->peer()});
+  }
+  if (!proxy->peer()->linkToDeath(notice, 0, wp<IBase>(static_cast<IBase*>(binder)),
+                                  proxy->serial())) {
+    std::lock_guard<std::mutex> g(r->state->linksLock);
+    auto& links = r->state->links;
+    links.erase(std::remove_if(links.begin(), links.end(),
+                               [&](const AIBinder_DeathRecipient::Link& l) {
+                                 return l.notice == notice;
+                               }),
+                links.end());
     return STATUS_DEAD_OBJECT;
   }
-  std::lock_guard<std::mutex> g(r->linksLock);
-  r->links.push_back({binder, cookie, notice});
   return STATUS_OK;
 }
 
@@ -192,21 +232,34 @@ binder_status_t AIBinder_unlinkToDeath(AIBinder* binder, AIBinder_DeathRecipient
   if (binder == nullptr || r == nullptr) return STATUS_UNEXPECTED_NULL;
   ProxyBase* proxy = proxyOf(binder);
   if (proxy == nullptr) return STATUS_INVALID_OPERATION;
-  sp<::android::hardware::hidl_death_recipient> notice;
+  AIBinder_DeathRecipient::Link link;
   {
-    std::lock_guard<std::mutex> g(r->linksLock);
-    auto it = std::find_if(r->links.begin(), r->links.end(), [&](const auto& l) {
-      return l.binder == binder && l.cookie == cookie;
+    std::lock_guard<std::mutex> g(r->state->linksLock);
+    auto& links = r->state->links;
+    auto it = std::find_if(links.begin(), links.end(), [&](const auto& l) {
+      return l.binder == proxy->serial() && l.cookie == cookie;
     });
-    if (it == r->links.end()) return STATUS_BAD_VALUE;
-    notice = it->notice;
-    r->links.erase(it);
+    if (it == links.end()) return STATUS_BAD_VALUE;
+    link = std::move(*it);
+    links.erase(it);
   }
-  proxy->peer()->unlinkToDeath(notice, wp<IBase>(static_cast<IBase*>(binder)));
+  unlinkFromPeer(link);
   return STATUS_OK;
 }
 
 }  // extern "C"
+
+namespace android {
+namespace host {
+
+size_t liveDeathLinksForTest(const AIBinder_DeathRecipient* r) {
+  // Every link holds one notice, in the recipient's table and in its
+  // connection's; each notice holds the state once.
+  return r == nullptr ? 0 : static_cast<size_t>(r->state.use_count() - 1);
+}
+
+}  // namespace host
+}  // namespace android
 
 namespace android {
 namespace host {

@@ -101,20 +101,20 @@ class ClientPeer : public RemotePeer, public std::enable_shared_from_this<Client
   }
 
   bool linkToDeath(const sp<hardware::hidl_death_recipient>& recipient, uint64_t cookie,
-                   const wp<IBase>& who) override {
+                   const wp<IBase>& who, uint64_t whoSerial) override {
     std::lock_guard<std::recursive_mutex> g(mIo);
     if (mDead || recipient == nullptr) return false;
-    mLinks.push_back({recipient, cookie, who});
+    mLinks.push_back({recipient, cookie, who, whoSerial});
     return true;
   }
 
   bool unlinkToDeath(const sp<hardware::hidl_death_recipient>& recipient,
-                     const wp<IBase>& who) override {
+                     uint64_t whoSerial) override {
     std::lock_guard<std::recursive_mutex> g(mIo);
     size_t before = mLinks.size();
     mLinks.erase(std::remove_if(mLinks.begin(), mLinks.end(),
                                 [&](const DeathLink& l) {
-                                  return l.recipient == recipient && l.who == who;
+                                  return l.recipient == recipient && l.whoSerial == whoSerial;
                                 }),
                  mLinks.end());
     return mLinks.size() != before;

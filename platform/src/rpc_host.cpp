@@ -17,6 +17,8 @@ namespace host {
 
 namespace {
 std::atomic<RpcHooks*> g_hooks{nullptr};
+std::atomic<int> g_callbackAnswerMs{rpc::kCallbackAnswerMs};
+std::atomic<uint64_t> g_proxySerial{0};
 }  // namespace
 
 void setRpcHooks(RpcHooks* hooks) { g_hooks.store(hooks); }
@@ -25,6 +27,10 @@ namespace rpc {
 
 RpcHooks* currentHooks() { return g_hooks.load(); }
 
+int callbackAnswerLimitMs() { return g_callbackAnswerMs.load(std::memory_order_relaxed); }
+
+uint64_t nextProxySerial() { return g_proxySerial.fetch_add(1, std::memory_order_relaxed) + 1; }
+
 hardware::Status transportError(const std::string& message) {
   return hardware::Status::fromExceptionCode(hardware::Status::EX_TRANSACTION_FAILED, message);
 }
@@ -32,6 +38,10 @@ hardware::Status transportError(const std::string& message) {
 }  // namespace rpc
 
 void shutdownRpcHostForTest() { rpc::Host::get().shutdownHost(); }
+
+void setCallbackAnswerLimitForTest(int ms) {
+  g_callbackAnswerMs.store(ms > 0 ? ms : rpc::kCallbackAnswerMs, std::memory_order_relaxed);
+}
 
 }  // namespace host
 

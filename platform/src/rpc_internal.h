@@ -45,10 +45,12 @@ class RemotePeer {
   // Calls `method` on the peer's object `object` and waits for the reply.
   virtual hardware::Status call(uint32_t object, uint32_t method, const BodyWriter& args,
                                 std::vector<uint8_t>* reply) = 0;
+  // Links are kept by the proxy's serial (ProxyBase::serial), never by its
+  // address: a freed proxy's address may be given to the next one.
   virtual bool linkToDeath(const sp<hardware::hidl_death_recipient>& recipient, uint64_t cookie,
-                           const wp<hidl::base::V1_0::IBase>& who) = 0;
+                           const wp<hidl::base::V1_0::IBase>& who, uint64_t whoSerial) = 0;
   virtual bool unlinkToDeath(const sp<hardware::hidl_death_recipient>& recipient,
-                             const wp<hidl::base::V1_0::IBase>& who) = 0;
+                             uint64_t whoSerial) = 0;
   // Lets the peer call `object`; its id (never 0) in *id. False when this side
   // cannot export objects.
   virtual bool exportObject(const sp<hidl::base::V1_0::IBase>& object, StubFn stub,
@@ -59,18 +61,24 @@ class RemotePeer {
   virtual void setCallTimeout(int timeoutMs) = 0;
 };
 
+// A number no other proxy of this process has had or will have.
+uint64_t nextProxySerial();
+
 // What every proxy carries; lets host helpers find a proxy's connection.
 class ProxyBase {
  public:
   ProxyBase(std::shared_ptr<RemotePeer> peer, uint32_t object)
-      : mPeer(std::move(peer)), mObject(object) {}
+      : mPeer(std::move(peer)), mObject(object), mSerial(nextProxySerial()) {}
   virtual ~ProxyBase() = default;
   const std::shared_ptr<RemotePeer>& peer() const { return mPeer; }
   uint32_t object() const { return mObject; }
+  // Names this proxy in link tables for as long as the process runs.
+  uint64_t serial() const { return mSerial; }
 
  protected:
   std::shared_ptr<RemotePeer> mPeer;
   uint32_t mObject;
+  const uint64_t mSerial;
 };
 
 // The hooks installed by setRpcHooks(), or null.

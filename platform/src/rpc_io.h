@@ -22,6 +22,14 @@ using hidl::base::V1_0::IBase;
 
 // A peer that accepts no bytes of a reply for this long is dropped.
 constexpr int kWriteStallMs = 10000;
+// A client that does not answer a call on its callback object within this
+// long is taken for dead: its connection is dropped and its death notices
+// run, so that it cannot hold a pool thread. Healthy clients answer in
+// microseconds.
+constexpr int kCallbackAnswerMs = 5000;
+// kCallbackAnswerMs, unless a test has set another limit
+// (setCallbackAnswerLimitForTest in host/rpc_host.h).
+int callbackAnswerLimitMs();
 
 class UniqueFd {
  public:
@@ -70,6 +78,7 @@ struct DeathLink {
   sp<hardware::hidl_death_recipient> recipient;
   uint64_t cookie;
   wp<IBase> who;
+  uint64_t whoSerial;  // the key: `who`'s address may be reused once it is freed
 };
 
 bool validServiceName(const std::string& name);

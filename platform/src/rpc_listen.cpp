@@ -97,7 +97,7 @@ void Host::acceptSome(Listener* l) {
     const uint64_t id = ++mNextConnId;
     int raw = fd.get();
     auto c = std::make_shared<ServerConn>(std::move(fd), l->name, l->service, l->stub,
-                                          cred.pid, id);
+                                          cred.pid, cred.uid, id);
     mConns[id] = c;
     if (!control(EPOLL_CTL_ADD, raw, (id << 2) | kConn, kConnEvents)) {
       RPC_LOGE("cannot poll a connection to %s: %s", l->name.c_str(), strerror(errno));

@@ -33,10 +33,10 @@ void Host::join() {
 }
 
 // A call on `c` waits for its answer: reads what the connection has, then
-// waits until it has more or `wakeFd` tells that a pool thread read it.
-// A connection with its most calls queued is not read here either; only
-// its end is watched for.
-void Host::readWhileWaiting(const std::shared_ptr<ServerConn>& c, int wakeFd) {
+// waits until it has more, `wakeFd` tells that a pool thread read it, or
+// `deadline` comes. A connection with its most calls queued is not read
+// here either; only its end is watched for.
+void Host::readWhileWaiting(const std::shared_ptr<ServerConn>& c, int wakeFd, int64_t deadline) {
   bool full;
   {
     std::lock_guard<std::mutex> g(mLock);
@@ -57,7 +57,7 @@ void Host::readWhileWaiting(const std::shared_ptr<ServerConn>& c, int wakeFd) {
   if (!fresh.empty()) queue(fresh);
   if (fd < 0) return;  // closed: the caller sees it
   pollfd p[2] = {{fd, static_cast<short>(full ? 0 : POLLIN), 0}, {wakeFd, POLLIN, 0}};
-  if (poll(p, 2, -1) <= 0) return;
+  if (poll(p, 2, remainingMs(deadline)) <= 0) return;
   if (p[1].revents) {
     uint64_t drain;
     ssize_t unused = read(wakeFd, &drain, sizeof(drain));
@@ -70,6 +70,18 @@ void Host::readWhileWaiting(const std::shared_ptr<ServerConn>& c, int wakeFd) {
     }
     if (!fresh.empty()) queue(fresh);
   }
+}
+
+// Closes `c` as its client's end would: out of the set, its death notices
+// queued for the pool.
+void Host::drop(const std::shared_ptr<ServerConn>& c) {
+  std::vector<Task> fresh;
+  {
+    std::lock_guard<std::mutex> rg(c->readLock);
+    if (c->readClosed) return;
+    closeConnLocked(c, &fresh);
+  }
+  queue(fresh);
 }
 
 void Host::shutdownHost() {
@@ -191,6 +203,7 @@ void Host::run(Task& task, std::unique_lock<std::mutex>& lk) {
   if (lk.owns_lock()) lk.unlock();
   if (task.conn == nullptr) {
     if (task.death.recipient != nullptr) {
+      CallerScope dead(task.deadPid, task.deadUid);
       task.death.recipient->serviceDied(task.death.cookie, task.death.who);
     }
     task = Task();
@@ -375,12 +388,16 @@ void Host::closeConnLocked(const std::shared_ptr<ServerConn>& c, std::vector<Tas
     mConns.erase(c->id());
     if (mEpoll.get() >= 0) epoll_ctl(mEpoll.get(), EPOLL_CTL_DEL, c->fd(), nullptr);
   }
-  for (auto& link : c->markClosed()) fresh->push_back(Task{nullptr, Frame(), std::move(link)});
+  for (auto& link : c->markClosed()) {
+    fresh->push_back(Task{nullptr, Frame(), std::move(link), c->pid(), c->uid()});
+  }
 }
 
-void readWhileWaiting(const std::shared_ptr<ServerConn>& conn, int wakeFd) {
-  Host::get().readWhileWaiting(conn, wakeFd);
+void readWhileWaiting(const std::shared_ptr<ServerConn>& conn, int wakeFd, int64_t deadline) {
+  Host::get().readWhileWaiting(conn, wakeFd, deadline);
 }
+
+void dropConnection(const std::shared_ptr<ServerConn>& conn) { Host::get().drop(conn); }
 
 }  // namespace rpc
 }  // namespace host

@@ -47,7 +47,8 @@ class Host {
   status_t add(const std::string& dir, const std::string& name, const sp<IBase>& service,
                StubFn stub);
   void join();
-  void readWhileWaiting(const std::shared_ptr<ServerConn>& c, int wakeFd);
+  void readWhileWaiting(const std::shared_ptr<ServerConn>& c, int wakeFd, int64_t deadline);
+  void drop(const std::shared_ptr<ServerConn>& c);
   void shutdownHost();
 
  private:

@@ -1,12 +1,14 @@
 #pragma once
 // The server's side of one client connection: runs the calls read from it,
 // makes calls to the client's callback objects and keeps its death links.
+#include "rpc_caller.h"
 #include "rpc_io.h"
 
 #include <sys/eventfd.h>
 #include <sys/socket.h>
 
 #include <algorithm>
+#include <iterator>
 #include <map>
 #include <memory>
 #include <mutex>
@@ -20,23 +22,28 @@ namespace rpc {
 class ServerConn;
 // A thread in a call to a client waits for the answer by reading the
 // client's connection itself (defined with the pool, rpc_pool.cpp): the pool's
-// threads may all be busy.
-void readWhileWaiting(const std::shared_ptr<ServerConn>& conn, int wakeFd);
+// threads may all be busy. Returns when there was something to read or
+// `deadline` (nowMs) has come.
+void readWhileWaiting(const std::shared_ptr<ServerConn>& conn, int wakeFd, int64_t deadline);
+// Ends the connection as if its client had gone: its death notices run.
+void dropConnection(const std::shared_ptr<ServerConn>& conn);
 
 class ServerConn : public RemotePeer, public std::enable_shared_from_this<ServerConn> {
  public:
   ServerConn(UniqueFd fd, std::string name, sp<IBase> service, StubFn stub, pid_t pid,
-             uint64_t id)
+             uid_t uid, uint64_t id)
       : mFd(std::move(fd)),
         mName(std::move(name)),
         mService(std::move(service)),
         mStub(stub),
         mPid(pid),
+        mUid(uid),
         mId(id) {}
 
   int fd() const { return mFd.get(); }
   const std::string& name() const { return mName; }
   pid_t pid() const { return mPid; }
+  uid_t uid() const { return mUid; }
   uint64_t id() const { return mId; }
 
   // Whoever reads the connection holds readLock: the decoder and
@@ -66,7 +73,11 @@ class ServerConn : public RemotePeer, public std::enable_shared_from_this<Server
     BodyReader in(f.body);
     BodyWriter out;
     std::string error;
-    StubResult r = mStub(service, f.code, in, out, shared_from_this(), &error);
+    StubResult r;
+    {
+      CallerScope caller(mPid, mUid);
+      r = mStub(service, f.code, in, out, shared_from_this(), &error);
+    }
     switch (r) {
       case StubResult::Replied: {
         Frame reply;
@@ -132,9 +143,14 @@ class ServerConn : public RemotePeer, public std::enable_shared_from_this<Server
     if (mFd.get() >= 0) shutdown(mFd.get(), SHUT_RDWR);
   }
 
+  // A call on the client's object. The client has callbackAnswerLimitMs()
+  // to answer; past that it is dropped as dead, so that no client can keep
+  // the calling thread (a pool thread, mostly) for longer.
   hardware::Status call(uint32_t object, uint32_t method, const BodyWriter& args,
                         std::vector<uint8_t>* reply) override {
     if (!args.ok()) return transportError("arguments exceed the frame limit");
+    const int limitMs = callbackAnswerLimitMs();
+    const int64_t deadline = nowMs() + limitMs;
     // Tells this thread that a pool thread read its answer (or the end).
     UniqueFd wake(eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK));
     if (wake.get() < 0) return transportError("cannot wait for the client");
@@ -152,12 +168,13 @@ class ServerConn : public RemotePeer, public std::enable_shared_from_this<Server
     f.object = object;
     f.code = method;
     f.body = args.data();
-    if (!send(f)) {
+    if (!send(f, std::min(limitMs, kWriteStallMs))) {
       abort();
       std::lock_guard<std::mutex> g(mLock);
       mPending.erase(f.id);
       return transportError("cannot send to client");
     }
+    bool late = false;
     for (;;) {
       {
         std::lock_guard<std::mutex> g(mLock);
@@ -165,28 +182,39 @@ class ServerConn : public RemotePeer, public std::enable_shared_from_this<Server
           mPending.erase(f.id);
           break;
         }
+        if (remainingMs(deadline) == 0) {
+          mPending.erase(f.id);
+          late = true;
+          break;
+        }
       }
-      readWhileWaiting(shared_from_this(), wake.get());
+      readWhileWaiting(shared_from_this(), wake.get(), deadline);
+    }
+    if (late) {
+      RPC_LOGE("client pid %d of %s did not answer a callback within %d ms: dropped as dead",
+               mPid, mName.c_str(), limitMs);
+      dropConnection(shared_from_this());
+      return transportError("client did not answer within " + std::to_string(limitMs) + " ms");
     }
     if (!pending->done) return transportError("client connection closed");
     return statusOfAnswer(pending->frame, reply);
   }
 
   bool linkToDeath(const sp<hardware::hidl_death_recipient>& recipient, uint64_t cookie,
-                   const wp<IBase>& who) override {
+                   const wp<IBase>& who, uint64_t whoSerial) override {
     if (recipient == nullptr) return false;
     std::lock_guard<std::mutex> g(mLock);
     if (mClosed) return false;
-    mLinks.push_back({recipient, cookie, who});
+    mLinks.push_back({recipient, cookie, who, whoSerial});
     return true;
   }
 
   bool unlinkToDeath(const sp<hardware::hidl_death_recipient>& recipient,
-                     const wp<IBase>& who) override {
+                     uint64_t whoSerial) override {
     std::vector<DeathLink> removed;  // released outside the lock
     std::lock_guard<std::mutex> g(mLock);
     auto keep = std::stable_partition(mLinks.begin(), mLinks.end(), [&](const DeathLink& l) {
-      return !(l.recipient == recipient && l.who == who);
+      return !(l.recipient == recipient && l.whoSerial == whoSerial);
     });
     if (keep == mLinks.end()) return false;
     removed.assign(std::make_move_iterator(keep), std::make_move_iterator(mLinks.end()));
@@ -205,7 +233,14 @@ class ServerConn : public RemotePeer, public std::enable_shared_from_this<Server
       if (existing != nullptr) return existing;
     }
     sp<IBase> proxy = make(shared_from_this(), id);
-    if (!mClosed) mProxies[id] = proxy;
+    if (!mClosed) {
+      // Proxies the daemon has let go of are forgotten, so that a client
+      // passing ever new objects does not grow the table.
+      for (auto p = mProxies.begin(); p != mProxies.end();) {
+        p = p->second.promote() == nullptr ? mProxies.erase(p) : std::next(p);
+      }
+      mProxies[id] = proxy;
+    }
     return proxy;
   }
 
@@ -226,9 +261,9 @@ class ServerConn : public RemotePeer, public std::enable_shared_from_this<Server
     (void)unused;
   }
 
-  bool send(const Frame& f) {
+  bool send(const Frame& f, int stallMs = kWriteStallMs) {
     std::lock_guard<std::mutex> g(mWriteLock);
-    return mFd.get() >= 0 && sendFrame(mFd.get(), f, kWriteStallMs);
+    return mFd.get() >= 0 && sendFrame(mFd.get(), f, stallMs);
   }
 
   UniqueFd mFd;  // closed under readLock and mWriteLock
@@ -236,6 +271,7 @@ class ServerConn : public RemotePeer, public std::enable_shared_from_this<Server
   sp<IBase> mService;  // null once closed
   const StubFn mStub;
   const pid_t mPid;
+  const uid_t mUid;
   const uint64_t mId;
   std::mutex mWriteLock;  // keeps frames whole
   std::mutex mLock;
@@ -259,6 +295,8 @@ struct Task {
   std::shared_ptr<ServerConn> conn;  // set: run `frame` as a call on it
   Frame frame;
   DeathLink death{};  // else: tell this recipient
+  pid_t deadPid = 0;  // the client whose death it tells
+  uid_t deadUid = 0;
 };
 
 }  // namespace rpc

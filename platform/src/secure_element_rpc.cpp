@@ -95,10 +95,10 @@ class RemoteProxy : public I, public ProxyBase {
   bool isRemote() const override { return true; }
 
   Return<bool> linkToDeath(const sp<hidl_death_recipient>& recipient, uint64_t cookie) override {
-    return mPeer->linkToDeath(recipient, cookie, wp<IBase>(this));
+    return mPeer->linkToDeath(recipient, cookie, wp<IBase>(this), serial());
   }
   Return<bool> unlinkToDeath(const sp<hidl_death_recipient>& recipient) override {
-    return mPeer->unlinkToDeath(recipient, wp<IBase>(this));
+    return mPeer->unlinkToDeath(recipient, serial());
   }
 
  protected:

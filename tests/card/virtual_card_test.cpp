@@ -87,7 +87,9 @@ TEST(VirtualCardTest, Scripts) {
         // Partial fetches; another command or channel drops nothing but its own.
         {"01110010", "6110"}, {"01C0000004", pattern(0, 4) + "610C"}, {"00C000000C", "6985"},
         {"01CA0000", "6D00"}, {"01C000000C", "6985"},
-        {"0110010000", pattern(0, 256) + "9000"}, {"01101001", "6A86"}}},
+        {"0110010000", pattern(0, 256) + "9000"}, {"01101001", "6A86"},
+        // INS 12: in one response however long, whatever the Le.
+        {"0112010F00", pattern(0, 271) + "9000"}, {"0112000205", pattern(0, 2) + "9000"}}},
   };
   for (const Script& s : scripts) {
     VirtualCard card(se_card::CardOptions{s.channels, {}});

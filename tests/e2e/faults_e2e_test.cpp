@@ -61,9 +61,11 @@ class SimFaults : public ::testing::TestWithParam<OpenForm>, public System {
 
 // A SIM call stuck on a modem that does not answer, two more SIM callers
 // behind it: eSE1 calls and an eSE client's death notice still get a thread
-// within a second; the callers behind the stuck one give up.
+// within a second; a caller beyond the three SIM1 admits is refused at once;
+// the callers behind the stuck one give up at the hang bound.
 TEST_P(SimFaults, ASilentModemLeavesEse1Answering) {
   ASSERT_NO_FATAL_FAILURE(startModem({"--silent-on", "AT+CSIM"}));
+  root.property("vendor.secure_element.sim.hang_ms=5000");
   daemon = startDaemon(root);
   SecliSession sim(root, "SIM1");
   ASSERT_TRUE(initSim(sim));
@@ -75,13 +77,17 @@ TEST_P(SimFaults, ASilentModemLeavesEse1Answering) {
   // Connected already, so that their calls reach the daemon before eSE1's.
   SecliSession sim2(root, "SIM1");
   SecliSession sim3(root, "SIM1");
-  for (SecliSession* s : {&sim2, &sim3}) ASSERT_EQ(field(s->call("present"), "present"), "true");
+  SecliSession sim4(root, "SIM1");
+  for (SecliSession* s : {&sim2, &sim3, &sim4}) ASSERT_EQ(field(s->call("present"), "present"), "true");
 
   size_t mark = modem->err().size();
+  const size_t daemonMark = daemon->err().size();
   sim.send(kBasicGetData);
   ASSERT_TRUE(modem->err().waitFor("< AT+CSIM=", mark));  // now stuck at the modem
+  const auto sent = Clock::now();
   sim2.send("present");
   sim3.send(echoCommand(ch, "AA"));
+  sim4.send("present");
 
   auto t0 = Clock::now();
   EXPECT_EQ(field(ese.call(kBasicGetData), "response").substr(0, 2), "66");
@@ -97,17 +103,25 @@ TEST_P(SimFaults, ASilentModemLeavesEse1Answering) {
   RecordProperty("ese_death_notice_ms", static_cast<int>(msSince(t0)));
   victim.reset();
 
+  // One of the three callers behind the stuck one found SIM1 full and was
+  // refused; the other two gave up at the hang bound. Each got its failure.
   EXPECT_EQ(field(answerOf(sim2), "present"), "false");
   EXPECT_EQ(field(answerOf(sim3), "response"), "");
-  EXPECT_TRUE(daemon->err().waitFor("SIM busy: call given up"));
+  EXPECT_EQ(field(answerOf(sim4), "present"), "false");
+  EXPECT_GE(msSince(sent), 4500);
+  EXPECT_TRUE(daemon->err().waitFor("SIM1 without progress for", daemonMark));
+  EXPECT_EQ(countOf(daemon->err().text().substr(daemonMark), "SIM1 busy with 3 callers: call refused"), 1u);
   std::string line;
   EXPECT_FALSE(sim.answer(&line, 0)) << "the silent modem answered: " << line;
 
-  // The stuck client itself dies: its death notice is taken as well.
+  // The stuck client itself dies: its death notice is taken as well, and the
+  // close of its channel waits for the modem.
   mark = daemon->err().size();
   t0 = Clock::now();
   sim.process().stop(SIGKILL);
   EXPECT_TRUE(daemon->err().waitFor("ZerbSimSecureElement: serviceDied, enter", mark));
+  EXPECT_TRUE(daemon->err().waitFor("serviceDied, close of channel " + std::to_string(ch) +
+                                        ", SIM1 busy: queued until it is free", mark));
   EXPECT_LT(msSince(t0), 1000);
 }
 
@@ -235,9 +249,11 @@ class EseFaults : public ::testing::Test, public System {
 };
 
 // A vendor library call that hangs: SIM1 is served within a second, other
-// eSE callers give up with their usual failure, a death notice is not held
-// up, and once the call returns the eSE serves again.
+// eSE callers give up with their usual failure at the hang bound, a death
+// notice is not held up, and once the call returns the close the death
+// notice left runs before the eSE serves again.
 TEST_F(EseFaults, AHungVendorCallLeavesSim1Answering) {
+  root.property("vendor.secure_element.ese.hang_ms=2000");
   ASSERT_NO_FATAL_FAILURE(start());
   SecliSession sim(root, "SIM1");
   ASSERT_TRUE(initSim(sim));
@@ -256,6 +272,7 @@ TEST_F(EseFaults, AHungVendorCallLeavesSim1Answering) {
   size_t mark = daemon->err().size();
   stuck.send(echoCommand(eseCh, "5A"));
   ASSERT_TRUE(daemon->err().waitFor("phQVNciHal_Transmit_APDU_by_IPC: hanging", mark));
+  const auto sent = Clock::now();
   other.send(echoCommand(eseCh, "5B"));
 
   auto t0 = Clock::now();
@@ -263,7 +280,8 @@ TEST_F(EseFaults, AHungVendorCallLeavesSim1Answering) {
   EXPECT_LT(msSince(t0), 1000);
   RecordProperty("sim_transmit_ms", static_cast<int>(msSince(t0)));
   EXPECT_EQ(field(answerOf(other), "response"), "1F");
-  EXPECT_TRUE(daemon->err().waitFor("transmit: the eSE library has not returned for", mark));
+  EXPECT_GE(msSince(sent), 1500);
+  EXPECT_TRUE(daemon->err().waitFor("transmit, eSE1 without progress for", mark));
   t0 = Clock::now();  // a later caller gives up at once
   EXPECT_EQ(field(other.call(std::string("open ") + kEchoApplet), "status"), "FAILED");
   EXPECT_LT(msSince(t0), 1000);
@@ -271,7 +289,7 @@ TEST_F(EseFaults, AHungVendorCallLeavesSim1Answering) {
   mark = daemon->err().size();
   t0 = Clock::now();
   victim->process().stop(SIGKILL);
-  EXPECT_TRUE(daemon->err().waitFor("serviceDied: the eSE library is in a call for", mark));
+  EXPECT_TRUE(daemon->err().waitFor("serviceDied, phQvEse_close, eSE1 busy: queued until it is free", mark));
   EXPECT_LT(msSince(t0), 1000);
   RecordProperty("ese_death_notice_ms", static_cast<int>(msSince(t0)));
   victim.reset();
@@ -281,7 +299,7 @@ TEST_F(EseFaults, AHungVendorCallLeavesSim1Answering) {
   mark = daemon->err().size();
   root.property("vendor.ese_sim.hang_exchange=0");
   EXPECT_EQ(field(answerOf(stuck), "response"), "5A9000");
-  EXPECT_TRUE(daemon->err().waitFor("serviceDied: the deferred library call runs now", mark));
+  EXPECT_TRUE(daemon->err().waitFor("serviceDied, phQvEse_close, eSE1: queued cleanup runs now", mark));
   EXPECT_TRUE(daemon->err().waitFor("phQvEse_close: closed", mark));
   ASSERT_EQ(field(other.call("init"), "state"), "true");
   EXPECT_EQ(echo(other, openEcho(other), "77"), "779000");

@@ -232,6 +232,27 @@ TEST_F(EsePcscTest, ResponsesFillTheBuffersToTheEdge) {
   EXPECT_EQ(r.rc, 0);
   EXPECT_EQ(r.data, pattern);
   EXPECT_EQ(r.sw, "9000");
+
+  // INS 12 answers N bytes at once, as a card with extended lengths: the
+  // most each route holds comes back whole, one byte more is refused.
+  struct Row {
+    bool ipc;
+    uint16_t n;  // data bytes the card answers, SW1 SW2 after them
+    bool fits;
+  };
+  for (const Row& row : {Row{true, 268, true}, Row{true, 269, false}, Row{false, 256, true}, Row{false, 257, false}}) {
+    SCOPED_TRACE(std::string(row.ipc ? "IPC " : "Transceive ") + std::to_string(row.n));
+    std::string want;
+    for (int i = 0; i < row.n; ++i) want += hex({static_cast<uint8_t>(i)});
+    const uint8_t p1 = static_cast<uint8_t>(row.n >> 8), p2 = static_cast<uint8_t>(row.n & 0xFF);
+    if (row.ipc) {
+      EXPECT_EQ(ipc("0112" + hex({p1, p2})), row.fits ? want + "9000" : "rc=-1 len=0");
+    } else {
+      const Rpdu t = transceive(cpdu(0x01, 0x12, p1, p2, 0, 0));
+      EXPECT_EQ(t.rc, row.fits ? 0 : -1);
+      EXPECT_EQ(t.data, row.fits ? want : "");
+    }
+  }
 }
 
 // Fewer bytes than an APDU header are refused, never sent: vpcd would take

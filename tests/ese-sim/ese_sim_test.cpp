@@ -2,8 +2,13 @@
 #include <gtest/gtest.h>
 
 #include <stdlib.h>
+#include <unistd.h>
 
+#include <chrono>
+#include <cstdio>
 #include <cstring>
+#include <fstream>
+#include <sstream>
 #include <string>
 #include <thread>
 #include <vector>
@@ -167,6 +172,18 @@ TEST_F(EseSimTest, ResponsesStayWithinTheCallersBuffers) {
   // A command longer than any short APDU, and an empty one.
   EXPECT_EQ(ipc(Bytes(5000, 0x00)), ok({0x67, 0x00}));
   EXPECT_EQ(ipc({}), ok({0x67, 0x00}));
+
+  // At the edge, with INS 12 answering N bytes at once: 256 data bytes come
+  // back whole on both routes, one more is refused with nothing handed back.
+  for (const uint16_t n : {256, 257}) {
+    SCOPED_TRACE(n);
+    Bytes want(n);
+    for (size_t i = 0; i < n; ++i) want[i] = static_cast<uint8_t>(i);
+    want.insert(want.end(), {0x90, 0x00});
+    const Bytes cmd = {0x00, 0x12, static_cast<uint8_t>(n >> 8), static_cast<uint8_t>(n & 0xFF)};
+    EXPECT_EQ(ipc(cmd), n <= 256 ? ok(want) : failed());
+    EXPECT_EQ(trx(cmd, {}, 0), n <= 256 ? ok(want) : failed({0x00, 0x00}));
+  }
 }
 
 TEST_F(EseSimTest, MalformedRecordsAreRefused) {
@@ -197,6 +214,57 @@ TEST_F(EseSimTest, MalformedRecordsAreRefused) {
   phQvEse_data out{0, nullptr};
   EXPECT_NE(phQVNciHal_Transmit_APDU_by_IPC(&in, &out), 0);
   EXPECT_EQ(out.len, 0u);
+}
+
+// Standard error, where the library logs, goes to a file while this lives.
+class StderrToFile {
+ public:
+  explicit StderrToFile(std::string path) : path_(std::move(path)), saved_(dup(STDERR_FILENO)) {
+    fflush(stderr);
+    FILE* f = fopen(path_.c_str(), "w");
+    if (f != nullptr) {
+      dup2(fileno(f), STDERR_FILENO);
+      fclose(f);
+    }
+  }
+  ~StderrToFile() {
+    fflush(stderr);
+    dup2(saved_, STDERR_FILENO);
+    close(saved_);
+  }
+  std::string text() const {
+    std::ostringstream s;
+    s << std::ifstream(path_).rdbuf();
+    return s.str();
+  }
+
+ private:
+  std::string path_;
+  int saved_;
+};
+
+// A long but healthy command: only the P1 named is slowed, on both routes,
+// and the wait is logged when it starts.
+TEST_F(EseSimTest, SlowCommandByP1) {
+  ASSERT_EQ(phQvEse_init_open(), 0);
+  ASSERT_EQ(trx({0x00, 0xA4, 0x04, 0x00}, se_card::aid::kEcho).first, true);
+  setProp("slow_p1", "3a");
+  setProp("slow_ms", "300");
+  StderrToFile err(root_.at("stderr"));
+  const auto msTaken = [](auto&& exchange) {
+    const auto t0 = std::chrono::steady_clock::now();
+    const Reply r = exchange();
+    EXPECT_EQ(r, ok({0xCA, 0xFE, 0x90, 0x00}));
+    return std::chrono::duration_cast<std::chrono::milliseconds>(std::chrono::steady_clock::now() - t0).count();
+  };
+  EXPECT_GE(msTaken([] { return ipc({0x00, 0x01, 0x3A, 0x00, 0x02, 0xCA, 0xFE}); }), 300);
+  EXPECT_GE(msTaken([] { return trx({0x00, 0x01, 0x3A, 0x00}, {0xCA, 0xFE}, 0); }), 300);
+  EXPECT_LT(msTaken([] { return ipc({0x00, 0x01, 0x3B, 0x00, 0x02, 0xCA, 0xFE}); }), 300);
+  setProp("slow_p1", "3x");  // not a byte: nothing is slowed
+  EXPECT_LT(msTaken([] { return ipc({0x00, 0x01, 0x3A, 0x00, 0x02, 0xCA, 0xFE}); }), 300);
+  const std::string log = err.text();
+  EXPECT_NE(log.find("IPC: slow command (P1 3A), answering in 300 ms"), std::string::npos) << log;
+  EXPECT_NE(log.find("Transceive: slow command (P1 3A), answering in 300 ms"), std::string::npos) << log;
 }
 
 // The daemon calls init and serviceDied (open, close) without its lock while

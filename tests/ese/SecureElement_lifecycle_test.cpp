@@ -55,13 +55,15 @@ TEST_F(EseLifecycle, InitSweepsFlaggedChannelsOneToThreeWhenReadyAndServiceDiedK
   se->init(client);
   fake_ese::setReadyStatus(0);
   fake_ese::queueTransceive({0, {}, 0x90, 0x00});
-  fake_ese::queueTransceive({-1, {}, 0x00, 0x00});  // a failed close is ignored
+  fake_ese::queueTransceive({-1, {}, 0x00, 0x00});  // the library fails: made again after init
+  fake_ese::queueTransceive({0, {}, 0x90, 0x00});
   se->init(client);
   EXPECT_EQ(fake_ese::calls(), (Calls{"close", "status", "open", "status", closeLine(1), kPowerOff,
-                                      closeLine(3), kPowerOff, "open"}));
+                                      closeLine(3), kPowerOff, "open", closeLine(3), kPowerOff}));
   EXPECT_TRUE(logged(cap, "serviceDied enter!", ANDROID_LOG_ERROR));
   EXPECT_TRUE(logged(cap, "internalCloseChannel enter!", ANDROID_LOG_INFO));
-  EXPECT_TRUE(sweepFlags(se).empty());  // the failed close's flag cleared too
+  EXPECT_TRUE(SecureElement::gate().idle());
+  EXPECT_TRUE(sweepFlags(se).empty());
 }
 
 TEST_F(EseLifecycle, TransmitRewritesCaseOneAndGetResponseAndPassesTheAnswerOn) {
@@ -170,40 +172,42 @@ class LockHolder {
   std::future<void> done_;
 };
 
-TEST_F(EseLifecycle, ChannelOperationsAndTransmitWaitForTheLockTheOthersDoNot) {
+// Every operation that reaches the library waits for the one holding it; a
+// death notice does not wait, its close runs as the holder lets go; presence
+// and ATR never reach the library.
+TEST_F(EseLifecycle, LibraryCallsWaitForTheHolderDeathNoticesAndTheOthersDoNot) {
   const std::string held = "ipc 00 CA 00 00 00";
   struct Row {
     std::string first;  // the operation's first library call or note
     std::function<void()> op;
-    bool waits;
+    bool returnsWhileHeld;
+    bool callsAfterRelease;
   };
   const std::vector<Row> rows = {
-      {"ready", [&] { openLogical(se, kAid, 0); }, true},
-      {"ready", [&] { openBasic(se, kAid, 0); }, true},
-      {closeLine(1), [&] { se->closeChannel(1); }, true},
-      {"ipc 00 B0 00 00 01", [&] { transmit(se, {0x00, 0xB0, 0x00, 0x00, 0x01}); }, true},
-      {"status", [&] { se->init(client); }, false},
-      {"close", [&] { se->serviceDied(0, ::android::wp<IBase>()); }, false},
-      {"present", [&] { fake_ese::note(se->isCardPresent() ? "present" : "absent"); }, false},
-      {"atr", [&] { se->getAtr([](const hidl_vec<uint8_t>& a) { fake_ese::note(a.size() ? "?" : "atr"); }); }, false},
+      {"ready", [&] { openLogical(se, kAid, 0); }, false, true},
+      {"ready", [&] { openBasic(se, kAid, 0); }, false, true},
+      {closeLine(1), [&] { se->closeChannel(1); }, false, true},
+      {"ipc 00 B0 00 00 01", [&] { transmit(se, {0x00, 0xB0, 0x00, 0x00, 0x01}); }, false, true},
+      {"status", [&] { se->init(client); }, false, true},
+      {"close", [&] { se->serviceDied(0, ::android::wp<IBase>()); }, true, true},
+      {"present", [&] { fake_ese::note(se->isCardPresent() ? "present" : "absent"); }, true, false},
+      {"atr", [&] { se->getAtr([](const hidl_vec<uint8_t>& a) { fake_ese::note(a.size() ? "?" : "atr"); }); }, true, false},
   };
   for (const auto& row : rows) {
     SCOPED_TRACE(row.first);
     fake_ese::reset();
     LockHolder holder(se);
     Contender contender(row.op);
-    // One that does not wait is done while the lock is still held.
-    if (!row.waits) {
+    if (row.returnsWhileHeld) {
       EXPECT_TRUE(contender.finishes());
     }
     holder.release();
     ASSERT_TRUE(contender.finishes());
-    // The lock is released before the contender's first call exactly when it waits.
     const Calls calls = fake_ese::calls();
     const auto at = [&](const std::string& line) { return std::find(calls.begin(), calls.end(), line); };
     ASSERT_EQ(calls.front(), held);
     ASSERT_NE(at(row.first), calls.end());
-    EXPECT_EQ(at("released") < at(row.first), row.waits);
+    EXPECT_EQ(at("released") < at(row.first), row.callsAfterRelease);
   }
 }
 

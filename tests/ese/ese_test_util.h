@@ -13,6 +13,7 @@
 
 #include "SecureElement.h"
 #include "fake_ese_hal.h"
+#include "se_device_gate.h"
 
 namespace ese_test {
 
@@ -134,6 +135,8 @@ class EseFixture : public ::testing::Test {
   void SetUp() override {
     setBufferAllocFailureForTest(0);
     for (uint8_t c = 0; c < 4; ++c) se->closeChannel(c);
+    // Closes owed by an earlier test are not this one's.
+    SecureElement::gate().forgetChannels();
     fake_ese::reset();
     cap.clear();
   }

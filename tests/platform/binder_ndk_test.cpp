@@ -10,11 +10,13 @@
 #include <host/aidl_host.h>
 #include <host/rpc_host.h>
 
+#include <atomic>
 #include <condition_variable>
 #include <future>
 #include <mutex>
 #include <thread>
 
+#include "rpc_test_util.h"
 #include "test_root.h"
 
 namespace {
@@ -67,10 +69,15 @@ class Service : public BnSecureElement {
   ScopedAStatus init(const std::shared_ptr<ISecureElementCallback>& cb) override {
     if (cb == nullptr) return ScopedAStatus::fromExceptionCode(EX_NULL_POINTER);
     linked = AIBinder_linkToDeath(cb->asBinder().get(), death.get(), this);
+    if (unlinkInInit) unlinked = AIBinder_unlinkToDeath(cb->asBinder().get(), death.get(), this);
     return cb->onStateChange(true, "up");
   }
   ScopedAStatus getAtr(Bytes*) override { return ScopedAStatus::ok(); }
-  ScopedAStatus isCardPresent(bool*) override { return ScopedAStatus::ok(); }
+  ScopedAStatus isCardPresent(bool*) override {
+    std::lock_guard<std::mutex> g(mu);
+    callers.push_back(AIBinder_getCallingPid());
+    return ScopedAStatus::ok();
+  }
   ScopedAStatus openBasicChannel(const Bytes&, int8_t, Bytes*) override {
     return ScopedAStatus::fromServiceSpecificErrorWithMessage(CHANNEL_NOT_AVAILABLE, "no basic");
   }
@@ -92,11 +99,51 @@ class Service : public BnSecureElement {
     ++self->deaths;
     self->cv.notify_all();
   }
+  bool waitDeaths(int n) {
+    std::unique_lock<std::mutex> lk(mu);
+    return cv.wait_for(lk, std::chrono::seconds(10), [&] { return deaths >= n; });
+  }
+
   ::ndk::ScopedAIBinder_DeathRecipient death{AIBinder_DeathRecipient_new(&Service::died)};
   binder_status_t linked = -1;
+  std::atomic<bool> unlinkInInit{false};
+  std::atomic<binder_status_t> unlinked{-1};
   std::mutex mu;
   std::condition_variable cv;
   int deaths = 0;
+  std::vector<pid_t> callers;
+};
+
+// An AIDL service registered as `instance`, served by a pool of `threads`.
+class AidlServer {
+ public:
+  AidlServer(const std::shared_ptr<Service>& service, const std::string& instance,
+             size_t threads)
+      : name(std::string(ISecureElement::descriptor) + "/" + instance) {
+    ::android::hardware::configureRpcThreadpool(threads, true);
+    status = AServiceManager_addService(service->asBinder().get(), name.c_str());
+    std::promise<void> left;
+    mJoinerLeft = left.get_future();
+    mJoiner = std::thread([p = std::move(left)]() mutable {
+      ABinderProcess_joinThreadPool();
+      p.set_value();
+    });
+  }
+  ~AidlServer() {
+    do {
+      ::android::host::shutdownRpcHostForTest();
+    } while (mJoinerLeft.wait_for(std::chrono::milliseconds(100)) != std::future_status::ready);
+    mJoiner.join();
+  }
+  std::shared_ptr<ISecureElement> connect() const {
+    return ISecureElement::fromBinder(::ndk::SpAIBinder(AServiceManager_checkService(name.c_str())));
+  }
+  const std::string name;
+  binder_exception_t status;
+
+ private:
+  std::future<void> mJoinerLeft;
+  std::thread mJoiner;
 };
 
 TEST(BinderObjects, ALocalObjectKeepsOneBinderAndComesBackAsItself) {
@@ -115,15 +162,9 @@ TEST(BinderObjects, ALocalObjectKeepsOneBinderAndComesBackAsItself) {
 TEST(BinderObjects, AnAidlServiceOverTheSocketWithItsClientsDeath) {
   se_test::TestRoot root;
   auto service = ::ndk::SharedRefBase::make<Service>();
-  const std::string name = std::string(ISecureElement::descriptor) + "/test1";
-  ::android::hardware::configureRpcThreadpool(2, true);
-  ASSERT_EQ(AServiceManager_addService(service->asBinder().get(), name.c_str()), EX_NONE);
-  std::promise<void> left;
-  std::future<void> joinerLeft = left.get_future();
-  std::thread joiner([p = std::move(left)]() mutable {
-    ABinderProcess_joinThreadPool();
-    p.set_value();
-  });
+  AidlServer server(service, "test1", 2);
+  const std::string& name = server.name;
+  ASSERT_EQ(server.status, EX_NONE);
   EXPECT_EQ(::android::host::listAidlServices(), std::vector<std::string>{name});
   EXPECT_EQ(AServiceManager_checkService((name + "x").c_str()), nullptr);
   {
@@ -149,14 +190,74 @@ TEST(BinderObjects, AnAidlServiceOverTheSocketWithItsClientsDeath) {
     EXPECT_EQ(out, big);
   }  // the connection closes: the client is gone
   EXPECT_EQ(service->linked, STATUS_OK);
-  {
-    std::unique_lock<std::mutex> lk(service->mu);
-    EXPECT_TRUE(service->cv.wait_for(lk, std::chrono::seconds(10), [&] { return service->deaths == 1; }));
+  EXPECT_TRUE(service->waitDeaths(1));
+}
+
+// Death links go with the death: none is left anywhere after many clients
+// died. They are keyed by their binder, not by an address a later proxy may
+// reuse: unlinking one client's binder leaves another's link alone.
+TEST(BinderObjects, DeathLinksGoWithTheirClientsAndStayWithTheirBinder) {
+  se_test::TestRoot root;
+  auto service = ::ndk::SharedRefBase::make<Service>();
+  // One thread runs notices and calls in the order they come.
+  AidlServer server(service, "links", 1);
+  ASSERT_EQ(server.status, EX_NONE);
+  AIBinder_DeathRecipient* recipient = service->death.get();
+  // A call answered only once the one pool thread let go of every notice
+  // that came before it.
+  auto settled = [&] {
+    bool present;
+    return server.connect()->isCardPresent(&present).isOk();
+  };
+  constexpr int kClients = 16;
+  for (int i = 0; i < kClients; ++i) {
+    auto cb = ::ndk::SharedRefBase::make<Callback>();
+    ASSERT_TRUE(server.connect()->init(cb).isOk());
   }
-  do {
-    ::android::host::shutdownRpcHostForTest();
-  } while (joinerLeft.wait_for(std::chrono::milliseconds(100)) != std::future_status::ready);
-  joiner.join();
+  ASSERT_TRUE(service->waitDeaths(kClients));
+  ASSERT_TRUE(settled());
+  EXPECT_EQ(::android::host::liveDeathLinksForTest(recipient), 0u);
+
+  // The service keeps no callback, so each proxy is freed after its init and
+  // the next one may get its address.
+  auto first = server.connect();
+  auto second = server.connect();
+  auto cb = ::ndk::SharedRefBase::make<Callback>();
+  ASSERT_TRUE(first->init(cb).isOk());
+  EXPECT_EQ(::android::host::liveDeathLinksForTest(recipient), 1u);
+  service->unlinkInInit = true;
+  ASSERT_TRUE(second->init(cb).isOk());
+  EXPECT_EQ(service->unlinked, STATUS_OK);
+  EXPECT_EQ(::android::host::liveDeathLinksForTest(recipient), 1u);
+  second = nullptr;
+  first = nullptr;
+  ASSERT_TRUE(service->waitDeaths(kClients + 1));
+  ASSERT_TRUE(settled());
+  {
+    std::lock_guard<std::mutex> g(service->mu);
+    EXPECT_EQ(service->deaths, kClients + 1);  // the unlinked client's death is not told
+  }
+  EXPECT_EQ(::android::host::liveDeathLinksForTest(recipient), 0u);
+}
+
+// A call carries its client process's pid; outside a call, this process's.
+TEST(BinderObjects, CallsCarryTheirClientsPid) {
+  se_test::TestRoot root;
+  auto service = ::ndk::SharedRefBase::make<Service>();
+  AidlServer server(service, "pid", 2);
+  ASSERT_EQ(server.status, EX_NONE);
+  const std::vector<uint8_t> isCardPresent =
+      fake::frameBytes(::android::host::rpc::FrameKind::Call, 1, 0, 4, {});
+  const pid_t child = fake::callFromChild(::android::host::aidlSocketPath(server.name), isCardPresent);
+  ASSERT_GT(child, 0);
+  bool present;
+  ASSERT_TRUE(server.connect()->isCardPresent(&present).isOk());
+  {
+    std::lock_guard<std::mutex> g(service->mu);
+    EXPECT_EQ(service->callers, (std::vector<pid_t>{child, getpid()}));
+  }
+  EXPECT_EQ(AIBinder_getCallingPid(), getpid());
+  EXPECT_EQ(AIBinder_getCallingUid(), getuid());
 }
 
 }  // namespace

@@ -10,7 +10,9 @@
 //   closeChannel  -> SUCCESS for an open channel, FAILED otherwise
 //   init(cb)      -> links to the callback's death (cookie 0) and, unless
 //                    deferred, calls onStateChange(true) before returning
+// init and every death notice record the calling pid the host reports.
 #include <android/hardware/secure_element/1.0/ISecureElement.h>
+#include <hwbinder/IPCThreadState.h>
 
 #include <atomic>
 #include <chrono>
@@ -45,6 +47,7 @@ class DeathWatcher : public hidl_death_recipient {
  public:
   void serviceDied(uint64_t cookie, const wp<IBase>& who) override {
     std::lock_guard<std::mutex> g(mLock);
+    mPids.push_back(::android::hardware::IPCThreadState::self()->getCallingPid());
     mCookies.push_back(cookie);
     mLastWho = who;
     mCv.notify_all();
@@ -61,11 +64,16 @@ class DeathWatcher : public hidl_death_recipient {
     std::lock_guard<std::mutex> g(mLock);
     return mLastWho;
   }
+  std::vector<pid_t> pids() {
+    std::lock_guard<std::mutex> g(mLock);
+    return mPids;
+  }
 
  private:
   std::mutex mLock;
   std::condition_variable mCv;
   std::vector<uint64_t> mCookies;
+  std::vector<pid_t> mPids;
   wp<IBase> mLastWho;
 };
 
@@ -84,6 +92,7 @@ class FakeSecureElement : public ISecureElement {
     {
       std::lock_guard<std::mutex> g(mLock);
       mCallback = cb;
+      mInitPids.push_back(::android::hardware::IPCThreadState::self()->getCallingPid());
       ++mInits;
       mCv.notify_all();
     }
@@ -179,10 +188,11 @@ class FakeSecureElement : public ISecureElement {
     return mCv.wait_for(lk, window, [&] { return mEntered >= n; });
   }
   bool waitEntered(int n) { return enteredWithin(n, kWaitLimit); }
-  bool waitInit() {
+  bool waitInit(int n = 1) {
     std::unique_lock<std::mutex> lk(mLock);
-    return mCv.wait_for(lk, kWaitLimit, [&] { return mInits > 0; });
+    return mCv.wait_for(lk, kWaitLimit, [&] { return mInits >= n; });
   }
+  std::vector<pid_t> initPids() { return locked(mInitPids); }
   sp<ISecureElementHalCallback> callback() { return locked(mCallback); }
   int maxRunning() { return locked(mMaxRunning); }
   std::vector<uint8_t> lastTransmit() { return locked(mLastTransmit); }
@@ -200,6 +210,7 @@ class FakeSecureElement : public ISecureElement {
   std::condition_variable mCv;
   sp<ISecureElementHalCallback> mCallback;
   int mInits = 0;
+  std::vector<pid_t> mInitPids;
   int mRunning = 0, mMaxRunning = 0, mEntered = 0, mReleases = 0;
   uint8_t mNextChannel = 0;
   std::set<uint8_t> mOpen;

@@ -3,6 +3,7 @@
 // the frames a proxy would never send).
 #include <gtest/gtest.h>
 
+#include <android/binder_process.h>
 #include <android/log.h>
 #include <host/log_capture.h>
 
@@ -177,29 +178,122 @@ TEST_F(RpcHostTest, ClientReceivesCallbackAfterItsCallReturned) {
   EXPECT_EQ(cb->states, std::vector<bool>{true});
 }
 
-TEST_F(RpcHostTest, PoolOfTwoRunsTwoCallsAtOnceAndTheThirdWaits) {
-  se->blockTransmit = true;
-  startServer(2);
-  std::atomic<int> ok{0};
-  std::vector<std::thread> callers;
-  for (int i = 0; i < 3; ++i) {
-    callers.emplace_back([&, i] {
-      sp<ISecureElement> client = ISecureElement::getService("SIM1");
-      if (client == nullptr) return;
-      std::vector<uint8_t> resp;
-      auto r = client->transmit({static_cast<uint8_t>(i)},
-                                [&](const hidl_vec<uint8_t>& x) { resp = x; });
-      if (r.isOk() && resp.size() == 3 && resp[0] == i) ++ok;
-    });
+// The joining thread included, a pool of n runs n calls at once; the next
+// one waits for a thread.
+TEST_F(RpcHostTest, PoolRunsAsManyCallsAtOnceAsItHasThreads) {
+  for (int n : {2, 4}) {
+    SCOPED_TRACE(n);
+    se = new FakeSecureElement();
+    se->blockTransmit = true;
+    startServer(static_cast<size_t>(n));
+    std::atomic<int> ok{0};
+    std::vector<std::thread> callers;
+    for (int i = 0; i <= n; ++i) {
+      callers.emplace_back([&, i] {
+        sp<ISecureElement> client = ISecureElement::getService("SIM1");
+        if (client == nullptr) return;
+        std::vector<uint8_t> resp;
+        auto r = client->transmit({static_cast<uint8_t>(i)},
+                                  [&](const hidl_vec<uint8_t>& x) { resp = x; });
+        if (r.isOk() && resp.size() == 3 && resp[0] == i) ++ok;
+      });
+    }
+    EXPECT_TRUE(se->waitEntered(n));
+    EXPECT_FALSE(se->enteredWithin(n + 1, std::chrono::milliseconds(300)));
+    se->release(1);
+    EXPECT_TRUE(se->waitEntered(n + 1));
+    se->release(n);
+    for (auto& t : callers) t.join();
+    EXPECT_EQ(ok, n + 1);
+    EXPECT_EQ(se->maxRunning(), n);
+    server->stop();
+    server.reset();
   }
-  EXPECT_TRUE(se->waitEntered(2));
-  EXPECT_FALSE(se->enteredWithin(3, std::chrono::milliseconds(300)));
-  se->release(1);
-  EXPECT_TRUE(se->waitEntered(3));
-  se->release(2);
-  for (auto& t : callers) t.join();
-  EXPECT_EQ(ok, 3);
-  EXPECT_EQ(se->maxRunning(), 2);
+}
+
+// A client that never answers a call on its callback holds a pool thread
+// for the answer limit only; then it counts as dead. Here both pool threads
+// are taken that way, and a third client must still be served.
+TEST_F(RpcHostTest, ClientsThatNeverAnswerACallbackAreDroppedAsDead) {
+  struct Case {
+    const char* name;
+    int clients;
+    int callsEach;  // every fourth one an init, the rest isCardPresent
+  };
+  const Case cases[] = {
+      {"two clients, one init each", 2, 1},
+      {"one client pipelining eight calls, two of them inits", 1, 8},
+  };
+  constexpr int kLimitMs = 300;
+  ::android::host::setCallbackAnswerLimitForTest(kLimitMs);
+  for (const Case& c : cases) {
+    SCOPED_TRACE(c.name);
+    se = new FakeSecureElement();
+    startServer(2);
+    LogCapture cap;
+    std::vector<int> silent;
+    int inits = 0;
+    for (int i = 0; i < c.clients; ++i) {
+      int fd = connectRaw("SIM1");
+      ASSERT_GE(fd, 0);
+      silent.push_back(fd);
+      std::vector<uint8_t> calls;
+      for (int k = 0; k < c.callsEach; ++k) {
+        // init(callback id k + 1): its u32 argument; isCardPresent has none
+        std::vector<uint8_t> f =
+            k % 4 == 0 ? frameBytes(FrameKind::Call, k + 1, 0, 1, {uint8_t(k + 1), 0, 0, 0})
+                       : frameBytes(FrameKind::Call, k + 1, 0, 3, {});
+        inits += k % 4 == 0;
+        calls.insert(calls.end(), f.begin(), f.end());
+      }
+      ASSERT_EQ(send(fd, calls.data(), calls.size(), MSG_NOSIGNAL),
+                static_cast<ssize_t>(calls.size()));
+    }
+    // Both threads wait for answers that never come.
+    ASSERT_TRUE(se->waitInit(inits));
+    sp<ISecureElement> third = ISecureElement::getService("SIM1");
+    ASSERT_NE(third, nullptr);
+    ASSERT_TRUE(::android::host::setCallTimeout(third, 10000));
+    const auto start = std::chrono::steady_clock::now();
+    EXPECT_TRUE(third->isCardPresent().isOk());
+    EXPECT_LT(std::chrono::steady_clock::now() - start, std::chrono::seconds(5));
+    // Each silent client went as if it had died: its links were told.
+    EXPECT_TRUE(se->watcher->waitDeaths(static_cast<size_t>(inits)));
+    for (int fd : silent) {
+      EXPECT_TRUE(closedByServer(fd));
+      close(fd);
+    }
+    EXPECT_TRUE(cap.contains("did not answer a callback within 300 ms", "hidl_host"));
+    EXPECT_TRUE(third->isCardPresent().isOk());
+    third = nullptr;
+    server->stop();
+    server.reset();
+  }
+  ::android::host::setCallbackAnswerLimitForTest(0);
+}
+
+// The service sees who calls: each client process's own pid, in its calls
+// and in its death notice; outside a call, this process.
+TEST_F(RpcHostTest, CallsAndDeathNoticesCarryTheirClientsPid) {
+  se->deferStateChange = true;
+  startServer(2);
+  const std::vector<uint8_t> init = frameBytes(FrameKind::Call, 1, 0, 1, {1, 0, 0, 0});
+  std::set<pid_t> children;
+  for (int i = 0; i < 2; ++i) children.insert(callFromChild(::android::host::serviceSocketPath("SIM1"), init));
+  ASSERT_EQ(children.size(), 2u);
+  ASSERT_EQ(children.count(-1), 0u);
+  ASSERT_TRUE(se->watcher->waitDeaths(2));
+  auto asSet = [](const std::vector<pid_t>& v) { return std::set<pid_t>(v.begin(), v.end()); };
+  EXPECT_EQ(asSet(se->initPids()), children);
+  EXPECT_EQ(asSet(se->watcher->pids()), children);
+
+  sp<ISecureElement> client = ISecureElement::getService("SIM1");
+  ASSERT_NE(client, nullptr);
+  ASSERT_TRUE(client->init(nullptr).isOk());
+  EXPECT_EQ(se->initPids().back(), getpid());
+  auto* self = ::android::hardware::IPCThreadState::self();
+  EXPECT_EQ(self->getCallingPid(), getpid());
+  EXPECT_EQ(self->getCallingUid(), getuid());
 }
 
 // The pool has no reader of its own: a client's answer to a callback must
@@ -357,9 +451,10 @@ TEST_F(RpcHostTest, CallsBeyondTheConnectionsLimitAreAllAnswered) {
   close(fd);
 }
 
-// The pool's threads are all the host starts: a pool of three is the
-// joining thread and two more, with no thread of its own for reading.
-TEST_F(RpcHostTest, PoolOfThreeStartsTwoThreads) {
+// The pool's threads are all the host starts: a pool of four is the
+// joining thread and three more, with no thread of its own for reading, and
+// the NDK's thread pool calls (AIDL) add none.
+TEST_F(RpcHostTest, PoolOfFourStartsThreeThreadsAndTheNdkPoolNone) {
   auto threads = [] {
     size_t n = 0;
     for (const auto& e : std::filesystem::directory_iterator("/proc/self/task")) {
@@ -372,11 +467,13 @@ TEST_F(RpcHostTest, PoolOfThreeStartsTwoThreads) {
   // thread sanitizer's) has done so before the count.
   std::thread([] {}).join();
   const size_t before = threads();
-  startServer(3);  // the helper joins on a thread of its own
+  startServer(4);  // the helper joins on a thread of its own
+  EXPECT_TRUE(ABinderProcess_setThreadPoolMaxThreadCount(1));
+  ABinderProcess_startThreadPool();
   sp<ISecureElement> client = ISecureElement::getService("SIM1");
   ASSERT_NE(client, nullptr);
   ASSERT_TRUE(client->isCardPresent().isOk());  // the joiner has joined
-  EXPECT_EQ(threads(), before + 3);
+  EXPECT_EQ(threads(), before + 4);
 }
 
 TEST_F(RpcHostTest, ClosedConnectionNotifiesLinkedAndNotUnlinkedRecipients) {
@@ -407,6 +504,13 @@ TEST_F(RpcHostTest, ClosedConnectionNotifiesLinkedAndNotUnlinkedRecipients) {
   // The client is gone: calls on its callback fail at once and link fails.
   EXPECT_FALSE(proxy->onStateChange(true).isOk());
   EXPECT_FALSE(static_cast<bool>(proxy->linkToDeath(linked, 9)));
+
+  // Told, the links are gone: nothing but the test holds the recipients.
+  // (The one pool thread answers this call only after it let go of the last
+  // notice.)
+  ASSERT_TRUE(ISecureElement::getService("SIM1")->isCardPresent().isOk());
+  EXPECT_EQ(linked->getStrongCount(), 1);
+  EXPECT_EQ(unlinked->getStrongCount(), 1);
 }
 
 TEST_F(RpcHostTest, BadFramesCloseOnlyTheirConnection) {

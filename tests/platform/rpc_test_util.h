@@ -10,6 +10,7 @@
 #include <stdlib.h>
 #include <sys/socket.h>
 #include <sys/un.h>
+#include <sys/wait.h>
 #include <unistd.h>
 
 #include <chrono>
@@ -87,6 +88,32 @@ inline std::vector<uint8_t> frameBytes(::android::host::rpc::FrameKind kind, uin
   std::vector<uint8_t> out;
   if (!::android::host::rpc::encodeFrame(f, &out)) out.clear();
   return out;
+}
+
+// Sends `call` (one whole frame) to the socket at `path` from a child
+// process, which exits once an answer has come. Returns the child's pid when
+// it got one, else -1.
+inline pid_t callFromChild(const std::string& path, const std::vector<uint8_t>& call) {
+  // Everything the child needs is made before the fork: this process runs
+  // the host's threads, so the child keeps to plain system calls.
+  sockaddr_un addr{};
+  addr.sun_family = AF_UNIX;
+  strncpy(addr.sun_path, path.c_str(), sizeof(addr.sun_path) - 1);
+  pid_t pid = fork();
+  if (pid < 0) return -1;
+  if (pid == 0) {
+    int fd = socket(AF_UNIX, SOCK_STREAM, 0);
+    if (fd < 0 || connect(fd, reinterpret_cast<const sockaddr*>(&addr), sizeof(addr)) != 0 ||
+        send(fd, call.data(), call.size(), MSG_NOSIGNAL) != static_cast<ssize_t>(call.size())) {
+      _exit(2);
+    }
+    char buf[64];
+    pollfd pfd{fd, POLLIN, 0};
+    _exit(poll(&pfd, 1, 10000) == 1 && recv(fd, buf, sizeof(buf), 0) > 0 ? 0 : 3);
+  }
+  int status = 0;
+  if (waitpid(pid, &status, 0) != pid || !WIFEXITED(status) || WEXITSTATUS(status) != 0) return -1;
+  return pid;
 }
 
 }  // namespace fake

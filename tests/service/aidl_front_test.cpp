@@ -96,7 +96,7 @@ class AidlFrontTest : public ::testing::Test {
         front(::ndk::SharedRefBase::make<AidlFront>(
             hidl, "eSE1",
             AidlFront::Element{[this](uint8_t c) { return hidl->open.count(c) != 0; },
-                               [this] { ++releases; }})),
+                               [this] { ++releases; return true; }})),
         states(::ndk::SharedRefBase::make<States>()) {}
 
   sp<ScriptedHidl> hidl;

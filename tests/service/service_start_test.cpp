@@ -81,10 +81,10 @@ TEST_F(ServiceStart, TheEseTypeDecidesWhichInstancesAreServed) {
     Events events;
   };
   // The AIDL faces come after the HIDL instances, eSE1 only with an eSE.
-  const Events both = {"configure 2 join", "register eSE1 type=", "configure 2 join",
+  const Events both = {"configure 4 join", "register eSE1 type=", "configure 4 join",
                        "register SIM1 type=", "register " + aidlName("eSE1") + " type=",
                        "register " + aidlName("SIM1") + " type=", "join"};
-  const Events simOnly = {"configure 2 join", "register SIM1 type=",
+  const Events simOnly = {"configure 4 join", "register SIM1 type=",
                           "register " + aidlName("SIM1") + " type=", "join"};
   const std::vector<Row> rows = {
       {0, simOnly}, {1, both}, {2, both}, {3, simOnly}, {-1, simOnly},
@@ -130,7 +130,7 @@ TEST_F(ServiceStart, FailedEseRegistrationRegistersNoSim) {
   fake_ese::setEseType(1);
   failures["eSE1"] = ::android::UNKNOWN_ERROR;
   EXPECT_EQ(qvese_service_main(), 1);
-  EXPECT_EQ(events, (Events{"configure 2 join", "register eSE1 type=1"}));
+  EXPECT_EQ(events, (Events{"configure 4 join", "register eSE1 type=1"}));
   EXPECT_EQ(priorityOf("SecureElement Registered eSE1 fail"), ANDROID_LOG_ERROR);
   EXPECT_EQ(priorityOf("SecureElement Registered eSE1 success"), -1);
   // The SIM instance was never even built.
@@ -145,9 +145,9 @@ TEST_F(ServiceStart, FailedSimRegistrationEndsWithoutJoining) {
     fake_ese::setEseType(type);
     failures["SIM1"] = -1;
     EXPECT_EQ(qvese_service_main(), 1);
-    Events expected = {"configure 2 join", "register SIM1 type=" + std::to_string(type)};
+    Events expected = {"configure 4 join", "register SIM1 type=" + std::to_string(type)};
     if (type == 1)
-      expected.insert(expected.begin(), {"configure 2 join", "register eSE1 type=1"});
+      expected.insert(expected.begin(), {"configure 4 join", "register eSE1 type=1"});
     EXPECT_EQ(events, expected);
     EXPECT_EQ(priorityOf("ZerbSimSecureElement Registered sim1 fail"), ANDROID_LOG_ERROR);
     EXPECT_EQ(priorityOf("ZerbSimSecureElement Registered sim1 success"), -1);
@@ -178,7 +178,7 @@ TEST_F(ServiceStart, FailedAidlRegistrationEndsWithoutJoining) {
     fake_ese::setEseType(1);
     failures[row.failing] = ::android::UNKNOWN_ERROR;
     EXPECT_EQ(qvese_service_main(), 1);
-    Events expected = {"configure 2 join", "register eSE1 type=1", "configure 2 join",
+    Events expected = {"configure 4 join", "register eSE1 type=1", "configure 4 join",
                        "register SIM1 type=1"};
     expected.insert(expected.end(), row.tail.begin(), row.tail.end());
     EXPECT_EQ(events, expected);

@@ -14,6 +14,8 @@
 #include "async_cmd.h"
 #include "port_open_seam.h"
 #include "se_delay.h"
+#include "se_device_gate.h"
+#include "session_release.h"
 #include "test_root.h"
 
 namespace sim_test {
@@ -65,7 +67,9 @@ inline void resetSim() {
   clear_session_table(1);
   curSessionTable = sessionTable[0];
   for (int m = 0; m < ASYNC_CMD_MODEM_MAX; m++) atPortOpened[m] = asyncCmdInited[m] = 0;
-  for (uint8_t& flag : g_simOpenedChannels) flag = 0;
+  for (auto& flag : g_simOpenedChannels) flag = 0;
+  for (int m = 0; m < ASYNC_CMD_MODEM_MAX; m++) session_release_forget(m);
+  ::android::hardware::secure_element::V1_0::implementation::ZerbSimSecureElement::gate().forgetChannels();
   timeflag = -1;
 }
 

@@ -269,17 +269,26 @@ TEST_F(Engine, OpenTakesTheBareSessionId) {
   EXPECT_EQ(1, g_asyncCmd.param);
 }
 
-// A SELECT that timed out leaves no release command behind it: the modem
-// did not answer one command and would hold the lock a third time-out.
-TEST_F(Engine, TimedOutSelectSendsNoRelease) {
+// A SELECT that timed out sends no release at once (the modem did not
+// answer one command and would hold the worker a third time-out), but the
+// session is not forgotten: it is released once the modem answers again.
+TEST_F(Engine, TimedOutSelectReleasesItsSessionOnceTheModemAnswers) {
   se_delay::setDivisorForTest(1000);  // 600 s become 600 ms
   startWorker(0);
-  modem0_->setScript(scriptOf({{"AT+CCHP=", okLine("+CCHP: 257")}, {"AT+CGLA=", ""}}));
+  std::atomic<bool> answering{false};
+  modem0_->setScript([&](FakeModem& m, const std::string& cmd) {
+    if (cmd.rfind("AT+CCHP=", 0) == 0) return m.send(okLine("+CCHP: 257"));
+    if (answering) m.send(finalLine("OK"));
+  });
   LogCapture cap;
   ASSERT_EQ(0, push(0, REQUEST_OPEN_LOGICAL_CHANNEL, kAid));
   EXPECT_EQ(1, g_asyncCmd.param);
   EXPECT_TRUE(cap.contains("transmit_select_cmd:cmd return errno=-4", kTag));
-  EXPECT_EQ(2u, modem0_->commands().size());
+  EXPECT_EQ(0u, modem0_->commands().at(1).rfind("AT+CGLA=257,", 0));
+  answering = true;
+  ASSERT_TRUE(waitUntil([] { return session_release_count(0) == 0; }));
+  EXPECT_EQ("AT+CCHC=257", modem0_->commands().back());
+  EXPECT_TRUE(cap.contains("released modem session 257", kTag));
 }
 
 TEST_F(Engine, FailedSelectClosesTheModemChannel) {

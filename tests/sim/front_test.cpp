@@ -5,11 +5,13 @@
 #include <log/log.h>
 
 #include <atomic>
+#include <chrono>
 #include <future>
 #include <thread>
 
 #include "engine_fixture.h"
 #include "fake_uptime.h"
+#include "se_device_gate.h"
 
 namespace {
 
@@ -145,6 +147,49 @@ TEST_F(Front, OpenLogicalChannelResults) {
   EXPECT_FALSE(se_->isChannelOpen(6));  // the refused SELECT left no flag
 }
 
+// The longest answers the request record holds come back whole: 263 bytes
+// of a transmit by +CSIM: or +CGLA:, 262 of a SELECT after the channel byte.
+// One byte more is refused, never cut.
+TEST_F(Front, LongestModemAnswersWholeOneByteMoreRefused) {
+  initAndWait();
+  const auto answer = [](size_t n) {
+    Bytes b(n);
+    for (size_t i = 0; i + 2 < n; i++) b[i] = static_cast<uint8_t>(i);
+    b[n - 2] = 0x90;
+    b[n - 1] = 0x00;
+    return b;
+  };
+  const auto line = [](const std::string& prefix, const Bytes& b) {
+    return okLine(prefix + " " + std::to_string(2 * b.size()) + ",\"" + sim_test::hexOf(b) + "\"");
+  };
+  modem0_->setScript(scriptOf({{"AT+CCHO=", okLine("+CCHO: 257")}, {"AT+CGLA=257,", okLine("+CGLA: 4,\"9000\"")}}));
+  ASSERT_EQ(SecureElementStatus::SUCCESS, open({0xA0, 0x00}, 0x7F).status);
+  struct Row {
+    const char* command;  // what the modem answers, and with which prefix
+    const char* prefix;
+    uint8_t cla;
+    size_t n;
+    bool fits;
+  };
+  const Row transmits[] = {{"AT+CSIM=", "+CSIM:", 0x00, 263, true}, {"AT+CSIM=", "+CSIM:", 0x00, 264, false},
+                           {"AT+CGLA=257,", "+CGLA:", 0x01, 263, true}, {"AT+CGLA=257,", "+CGLA:", 0x01, 264, false}};
+  for (const Row& r : transmits) {
+    SCOPED_TRACE(r.prefix + std::to_string(r.n));
+    modem0_->setScript(scriptOf({{r.command, line(r.prefix, answer(r.n))}}));
+    EXPECT_EQ(r.fits ? answer(r.n) : Bytes{}, transmit({r.cla, 0xB0, 0x00, 0x00}));
+  }
+  const Row selects[] = {{"AT+CGLA=258,", "+CGLA:", 0x00, 262, true}, {"AT+CGLA=258,", "+CGLA:", 0x00, 263, false}};
+  for (const Row& r : selects) {
+    SCOPED_TRACE("select " + std::to_string(r.n));
+    modem0_->setScript(scriptOf({{"AT+CCHO=", okLine("+CCHO: 258")},
+                                 {r.command, line(r.prefix, answer(r.n))},
+                                 {"AT+CCHC=258", finalLine("OK")}}));
+    const OpenResult o = open({0xA0, 0x00}, 0x7F);
+    EXPECT_EQ(r.fits ? SecureElementStatus::SUCCESS : SecureElementStatus::FAILED, o.status);
+    EXPECT_EQ(r.fits ? answer(r.n) : Bytes{}, o.select);
+  }
+}
+
 TEST_F(Front, NewInitClosesChannelsThreeToNineteenOnly) {
   initAndWait();
   for (int session : {0x101, 0x102, 0x103, 0x113}) {
@@ -204,10 +249,12 @@ TEST_F(Front, LogLinesHaveTheirPriorityAndBuffer) {
 }
 
 // A SIM call stuck on a silent modem holds the front's lock. Further SIM
-// calls, and init's sweep, give up with their usual failure instead of
-// tying up the RPC threads; calls that take no lock answer as always.
+// calls give up with their usual failure once the modem has been silent for
+// the hang bound; a close given up is queued and made once the modem is
+// free; calls that take no lock answer as always.
 TEST_F(Front, SilentModemDoesNotHoldUpOtherCallers) {
-  se_delay::setDivisorForTest(1);  // the real silence bound
+  se_delay::setDivisorForTest(1);
+  root_.writeFile("properties", "vendor.secure_element.sim.hang_ms=500\n");
   initAndWait();
   std::promise<void> written;
   std::atomic<bool> first{true};
@@ -238,47 +285,55 @@ TEST_F(Front, SilentModemDoesNotHoldUpOtherCallers) {
     return basic;
   });
   EXPECT_EQ(std::future_status::ready, lockFree.wait_for(at_test::kGenerous));
-  EXPECT_FALSE(cap.contains("openBasicChannel, modem silent"));
-  EXPECT_FALSE(cap.contains("serviceDied, modem silent"));
+  EXPECT_FALSE(cap.contains("openBasicChannel, SIM1 without progress"));
+  EXPECT_FALSE(cap.contains("serviceDied, SIM1 without progress"));
 
   EXPECT_FALSE(se_->isCardPresent());
   EXPECT_TRUE(atr().empty());
   EXPECT_TRUE(transmit({0x00, 0xB0, 0x00, 0x00}).empty());
   EXPECT_EQ(SecureElementStatus::FAILED, open({0xA0, 0x00}, 0).status);
   EXPECT_EQ(SecureElementStatus::FAILED, close(5));
-  initAndWait();
-  for (const char* op : {"isCardPresent", "getAtr", "transmit", "openLogicalChannel", "closeChannel", "init"}) {
-    std::vector<android::host::LogRecord> lines = cap.find(std::string(op) + ", modem silent for ", kTag);
+  for (const char* op : {"isCardPresent", "getAtr", "transmit", "openLogicalChannel", "closeChannel"}) {
+    std::vector<android::host::LogRecord> lines =
+        cap.find(std::string(op) + ", SIM1 without progress for ", kTag);
     ASSERT_EQ(1u, lines.size()) << op;
     EXPECT_EQ(ANDROID_LOG_ERROR, lines[0].priority) << op;
   }
-  EXPECT_EQ(1, g_simOpenedChannels[5]);  // not closed, so still flagged
+  EXPECT_TRUE(cap.contains("closeChannel 5, SIM1 busy: queued until it is free", kTag));
+  EXPECT_EQ(1, g_simOpenedChannels[5]);  // not closed yet, so still flagged
   EXPECT_EQ(1u, modem0_->commands().size());
 
   unstick.reset();
   EXPECT_EQ(SecureElementStatus::CHANNEL_NOT_AVAILABLE, lockFree.get());
   EXPECT_EQ((Bytes{0x90, 0x00}), stuck.get());
+  // The queued close ran as the stuck call let go of the modem.
+  EXPECT_EQ(0, g_simOpenedChannels[5]);
   EXPECT_EQ((Bytes{0x90, 0x00}), transmit({0x00, 0xB0, 0x00, 0x00}));
 }
 
-// Several callers on a working but slow modem (each answer takes 100 ms, so
-// the last caller waits far longer than the silence bound) all wait their
-// turn and get their own answers.
+// Callers on a working but slow modem (each answer takes 300 ms) all wait
+// their turn and get their own answers; one caller more than the front
+// admits is refused at once.
 TEST_F(Front, ConcurrentCallersOnAWorkingModemAreAllServed) {
   se_delay::setDivisorForTest(1);
   initAndWait();
   modem0_->setScript([](FakeModem& m, const std::string& cmd) {
-    std::this_thread::sleep_for(std::chrono::milliseconds(100));  // the modem's own pace
+    std::this_thread::sleep_for(std::chrono::milliseconds(300));  // the modem's own pace
     m.send(okLine("+CSIM: 6,\"" + cmd.substr(cmd.find('"') + 3, 2) + "9000\""));
   });
-  constexpr int kCallers = 8;
   std::vector<std::future<Bytes>> calls;
-  for (int i = 0; i < kCallers; i++) {
+  for (size_t i = 0; i < kCallersPerInstance; i++) {
     calls.push_back(std::async(std::launch::async, [this, i] {
       return transmit({0x00, static_cast<uint8_t>(0x10 + i), 0x00, 0x00});
     }));
   }
-  for (int i = 0; i < kCallers; i++) {
+  ASSERT_TRUE(waitUntil([] { return ZerbSimSecureElement::gate().callers() == kCallersPerInstance; }));
+  LogCapture cap;
+  const auto t0 = std::chrono::steady_clock::now();
+  EXPECT_TRUE(transmit({0x00, 0x20, 0x00, 0x00}).empty());
+  EXPECT_LT(std::chrono::steady_clock::now() - t0, std::chrono::milliseconds(100));
+  EXPECT_TRUE(cap.contains("transmit, SIM1 busy with 3 callers: call refused", kTag));
+  for (size_t i = 0; i < kCallersPerInstance; i++) {
     EXPECT_EQ((Bytes{static_cast<uint8_t>(0x10 + i), 0x90, 0x00}), calls[i].get());
   }
 }

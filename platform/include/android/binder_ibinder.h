@@ -4,6 +4,8 @@
 // of this process) or remote (a proxy for an object of a peer process).
 #include <cstdint>
 
+#include <sys/types.h>
+
 #include <android/binder_status.h>
 
 struct AIBinder;
@@ -35,4 +37,9 @@ binder_status_t AIBinder_linkToDeath(AIBinder* binder, AIBinder_DeathRecipient* 
                                      void* cookie);
 binder_status_t AIBinder_unlinkToDeath(AIBinder* binder, AIBinder_DeathRecipient* recipient,
                                        void* cookie);
+
+// The client process of the incoming call this thread serves (or whose
+// death notice it runs); outside of one, this process itself.
+pid_t AIBinder_getCallingPid();
+uid_t AIBinder_getCallingUid();
 }

@@ -1,6 +1,7 @@
 #pragma once
 // Host-only extras of the AIDL stand-in, for clients and tests. The daemon's
 // code never needs these; it uses the NDK calls only.
+#include <cstddef>
 #include <string>
 #include <vector>
 
@@ -21,6 +22,10 @@ std::vector<std::string> listAidlServices();
 // makes on this client's callbacks, and bound the wait for replies.
 int pollIncomingCalls(AIBinder* binder, int timeoutMs);
 bool setCallTimeout(AIBinder* binder, int timeoutMs);
+
+// Tests: the links of `recipient` alive anywhere in the host (its own table,
+// connections' tables, a notice being run).
+size_t liveDeathLinksForTest(const AIBinder_DeathRecipient* recipient);
 
 }  // namespace host
 }  // namespace android

@@ -34,5 +34,10 @@ bool setCallTimeout(const sp<hidl::base::V1_0::IBase>& proxy, int timeoutMs);
 // configured and used again afterwards.
 void shutdownRpcHostForTest();
 
+// Tests: how long the host waits for a client to answer a call on its
+// callback object before it drops the client as dead (the product's 5 s
+// otherwise); 0 or less restores 5 s.
+void setCallbackAnswerLimitForTest(int ms);
+
 }  // namespace host
 }  // namespace android
