@@ -59,6 +59,10 @@ const char kUsage[] =
     "                      answer unless --unsol gives EVERY)\n"
     "  --silent-on PREFIX  never answer a command starting with PREFIX (any case)\n"
     "  --close-after N     close the port (and remove the link) after N commands\n"
+    "  --channels-file F   keep in F the card's open logical channels: one line,\n"
+    "                      the numbers in ascending order separated by blanks\n"
+    "                      (empty: none; the basic channel is not listed),\n"
+    "                      rewritten (write and rename) whenever they change\n"
     "  --log FILE          log every line received (\"< ...\") and sent (\"> ...\")\n"
     "                      and events (\"# ...\") to FILE (default stderr)\n"
     "  --help              this text\n"
@@ -101,6 +105,7 @@ struct Options {
   std::string logPath;
   bool ttyDefaults = false;
   bool echo = false;
+  std::string channelsFile;
 };
 
 bool parseLong(const char* s, long min, long max, long& out) {
@@ -217,6 +222,30 @@ class Modem {
 
   void shutdown() { closePort(); }
 
+  // Rewrites --channels-file when the card's open channels changed (and once
+  // at start), so a watcher never reads a half-written list.
+  void reportChannels() {
+    if (o_.channelsFile.empty()) return;
+    std::string now;
+    for (int c = 1; c < se_card::kMaxChannels; ++c) {
+      if (!responder_.card().isChannelOpen(c)) continue;
+      if (!now.empty()) now += ' ';
+      now += std::to_string(c);
+    }
+    if (reported_ && now == lastChannels_) return;
+    const std::string tmp = o_.channelsFile + ".tmp";
+    const std::string text = now + "\n";
+    const int fd = ::open(tmp.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0644);
+    const bool written = fd >= 0 && writeAll(fd, text.data(), text.size());
+    if (fd >= 0) close(fd);
+    if (!written || rename(tmp.c_str(), o_.channelsFile.c_str()) != 0) {
+      logLine("#", "cannot write " + o_.channelsFile + ": " + strerror(errno));
+      return;
+    }
+    reported_ = true;
+    lastChannels_ = now;
+  }
+
  private:
   static constexpr size_t kMaxLine = 4096;
 
@@ -264,6 +293,7 @@ class Modem {
     } else {
       answer(responder_.handle(line));
     }
+    reportChannels();
     if (o_.closeAfter > 0 && commands_ >= o_.closeAfter) {
       logLine("#", "closing the port after " + std::to_string(commands_) + " commands");
       awaitDrained();
@@ -342,6 +372,8 @@ class Modem {
   long commands_ = 0;
   long answers_ = 0;
   unsigned unsolTurn_ = 0;
+  bool reported_ = false;
+  std::string lastChannels_;
 
  public:
   const std::string& ptsName() const { return ptsName_; }
@@ -357,7 +389,8 @@ int usageError(const char* msg) {
 int main(int argc, char** argv) {
   enum {
     kRoot = 1000, kModem, kCardAbsent, kAtr, kChannels, kSessionBase, kDelay, kSplit, kUnsol, kSms, kSilent,
-    kCloseAfter, kLog, kHelp, kBareOpen, kShortLength, kTtyDefaults, kEcho, kErrors, kNoVendor, kProfile
+    kCloseAfter, kLog, kHelp, kBareOpen, kShortLength, kTtyDefaults, kEcho, kErrors, kNoVendor, kProfile,
+    kChannelsFile
   };
   static const struct option longOpts[] = {
       {"root", required_argument, nullptr, kRoot},
@@ -380,6 +413,7 @@ int main(int argc, char** argv) {
       {"errors", required_argument, nullptr, kErrors},
       {"no-vendor-queries", no_argument, nullptr, kNoVendor},
       {"profile", required_argument, nullptr, kProfile},
+      {"channels-file", required_argument, nullptr, kChannelsFile},
       {"help", no_argument, nullptr, kHelp},
       {nullptr, 0, nullptr, 0},
   };
@@ -442,6 +476,7 @@ int main(int argc, char** argv) {
         o.responder.errors = modem_sim::ResponderOptions::Errors::kVerbose;
         o.responder.vendorQueries = false;
         break;
+      case kChannelsFile: o.channelsFile = optarg; break;
       case kHelp: fputs(kUsage, stdout); return 0;
       default: return usageError("unknown option");
     }
@@ -474,6 +509,7 @@ int main(int argc, char** argv) {
     modem.shutdown();
     return 1;
   }
+  modem.reportChannels();
   printf("modem-sim: modem %d ready on %s\n", o.modem, modem.ptsName().c_str());
   fflush(stdout);
   logLine("#", "modem " + std::to_string(o.modem) + " ready on " + modem.ptsName());

@@ -7,8 +7,10 @@
 #                            every fuzz target (build-fuzz/, clang), then the
 #                            whole suite built and run with address+undefined
 #                            (build-asan/), thread (build-tsan/) and no
-#                            sanitizer (build/). The plain pass comes last, so
-#                            the output ends with its ctest summary.
+#                            sanitizer (build/), with the chaos soak
+#                            (scripts/chaos.sh, 2 x 30 s) before the plain
+#                            tests. The plain pass comes last, so the output
+#                            ends with its ctest summary.
 #
 # Besides ctest (one process per test), every pass also runs each test binary
 # whole, once, in shuffled order (whole_runs below), which shows state that
@@ -98,6 +100,13 @@ pass() {  # name, build dir, sanitizer, [wrapper...]
 pass address "${ASAN_DIR:-build-asan}" address
 pass thread "${TSAN_DIR:-build-tsan}" thread "${tsan_wrap[@]}"
 if [ ${#failed[@]} -ne 0 ]; then echo "=== failed so far: ${failed[*]}"; fi
+# The chaos soak, 60 s in all: the fixed seed, then a new one; se-chaos
+# prints each seed first, so a failure can be replayed. It runs before the
+# plain pass's tests (it builds the same folder) so that the output still
+# ends with their ctest summary.
+stamp "chaos: 2 x 30 s"
+scripts/chaos.sh --seconds 30 --seed 1207 || failed+=(chaos-1207)
+scripts/chaos.sh --seconds 30 || failed+=(chaos)
 pass plain "${BUILD_DIR:-build}" ""
 # Nothing but the list of failed steps follows the last ctest summary.
 if [ ${#failed[@]} -ne 0 ]; then echo "=== failed: ${failed[*]}"; exit 1; fi

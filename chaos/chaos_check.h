@@ -1,0 +1,72 @@
+#pragma once
+// The soak's judge: what the virtual card must answer, whether a call's
+// result is right, a clean failure of a documented kind or wrong, and how long
+// a call may take with the faults active around it.
+#include <cstdint>
+#include <string>
+#include <vector>
+
+#include "chaos_plan.h"
+#include "chaos_record.h"
+
+namespace chaos {
+
+// The answers of the card behind both instances (card/), computed on a fresh
+// copy of it, so they do not depend on what other clients did.
+bool knownAid(const std::vector<uint8_t>& aid);
+// The select response an open of `aid` must carry: the card's answer to the
+// SELECT; on eSE1 the daemon fetches data the card leaves behind 61 xx, so
+// the whole FCI with 90 00. Empty for an AID the card lacks.
+std::vector<uint8_t> expectedSelect(Inst inst, const std::vector<uint8_t>& aid, uint8_t p2);
+// The card's answer to `apdu` on a channel where `aid` was selected with
+// `selectP2`, whatever channel the CLA names.
+std::vector<uint8_t> expectedResponse(const std::vector<uint8_t>& aid, uint8_t selectP2,
+                                      const std::vector<uint8_t>& apdu);
+// The SIM's basic channel keeps the card's default applet: its answer.
+std::vector<uint8_t> expectedBasicResponse(const std::vector<uint8_t>& apdu);
+std::vector<uint8_t> expectedAtr(Inst inst, bool pcsc);
+
+enum class Outcome { Ok, Clean, Wrong };
+const char* outcomeName(Outcome o);
+
+struct Verdict {
+  Outcome outcome = Outcome::Ok;
+  std::string why;  // Clean: which documented failure; Wrong: what was wrong
+};
+
+// What else was going on while the call ran.
+struct CallContext {
+  // transmit: nothing since the channel was opened could have closed it or
+  // given its number to another client (a reset, an init, a death on eSE1,
+  // the modem's restart...). When false any answer with a status word is a
+  // clean "channel lost".
+  bool channelCertain = true;
+  // reset: another client's init or reset ran at the same time, so state
+  // changes of its own may have reached this client's callback.
+  bool statesShared = false;
+  bool libFail = false;  // the eSE library failing exchanges during the call
+  // ... and the status word it leaves behind (0: none). eSE1 hands a failed
+  // exchange's leftover status word on as the answer: a documented failure.
+  int libFailSw = 0;
+  bool cardOut = false;  // PC/SC: the card out of its reader during the call
+  bool pcsc = false;
+};
+
+Verdict classify(const CallRecord& r, const CallContext& c);
+
+// Latency bounds: those the README's failure model gives, added up for the
+// faults active around the call.
+struct BoundConfig {
+  int64_t baseMs = 2000;       // a call on a healthy device, on a loaded 2-core machine
+  int64_t hangMs = 3000;       // the hang bound set in the run's properties
+  int64_t otherInstMs = 1000;  // what a fault on the other instance may add
+};
+// A fault still weighs on calls for this long after it ended: calls queued
+// behind it and the closes it left finish first.
+int64_t faultTailMs(const BoundConfig& c);
+// What one fault may add to a call on its own instance.
+int64_t faultAllowanceMs(const Fault& f, const BoundConfig& c);
+// The bound for a call given the faults that overlapped it (with their tails).
+int64_t callBoundMs(const std::vector<Fault>& sameInst, bool otherInstFaulty, const BoundConfig& c);
+
+}  // namespace chaos

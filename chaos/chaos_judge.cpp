@@ -1,0 +1,271 @@
+#include "chaos_judge.h"
+
+#include <algorithm>
+
+namespace chaos {
+
+namespace {
+
+constexpr int64_t kMs = 1000000;
+// A death notice or a queued close may take this long to reach the device
+// after the event that caused it.
+constexpr int64_t kSettleMarginNs = 1000 * kMs;
+
+bool dropsEveryChannel(FaultKind k) {
+  return k == FaultKind::ModemPortLost || k == FaultKind::ModemRestart || k == FaultKind::CardOut ||
+         k == FaultKind::OtherReset;
+}
+
+bool touchesDevice(Kind k) { return k == Kind::Transmit || k == Kind::Open || k == Kind::Basic; }
+
+}  // namespace
+
+Judge::Judge(uint64_t seed, const BoundConfig& bounds, bool pcsc, int64_t origin, FILE* out, int shown)
+    : seed_(seed), bounds_(bounds), pcsc_(pcsc), origin_(origin), out_(out), shown_(shown) {}
+
+std::string Judge::at(int64_t t) const {
+  char b[32];
+  snprintf(b, sizeof(b), "+%.3f s", static_cast<double>(t - origin_) / 1e9);
+  return b;
+}
+
+size_t Judge::addDrop(Inst inst, int64_t start, int64_t end, int channel, std::pair<int, int> by) {
+  Drop d{inst, start, end};
+  d.channel = channel;
+  d.by = by;
+  drops_.push_back(d);
+  return drops_.size() - 1;
+}
+
+void Judge::faultStarted(const Fault& f, int64_t t) {
+  std::lock_guard<std::mutex> l(mu_);
+  faults_.push_back({f, t, INT64_MAX});
+  if (dropsEveryChannel(f.kind)) {
+    faultDrops_[{static_cast<int>(f.kind), f.startMs}] = addDrop(faultInst(f.kind), t, INT64_MAX);
+  }
+}
+
+void Judge::faultEnded(const Fault& f, int64_t t) {
+  std::lock_guard<std::mutex> l(mu_);
+  for (FaultSpan& s : faults_) {
+    if (s.end == INT64_MAX && s.fault.kind == f.kind && s.fault.startMs == f.startMs) s.end = t;
+  }
+  auto it = faultDrops_.find({static_cast<int>(f.kind), f.startMs});
+  if (it != faultDrops_.end()) {
+    drops_[it->second].end = t + kSettleMarginNs;
+    faultDrops_.erase(it);
+  }
+}
+
+std::vector<FaultSpan> Judge::faults() const {
+  std::lock_guard<std::mutex> l(mu_);
+  return faults_;
+}
+
+void Judge::callStarted(int slot, int gen, long seq, Kind kind, Inst inst, int channel, int64_t t0) {
+  if (kind != Kind::Init && kind != Kind::Reset && kind != Kind::Close) return;
+  std::lock_guard<std::mutex> l(mu_);
+  // An init or a reset may close every channel of the instance (an init
+  // sweeps what earlier clients left); a close, that channel for whoever
+  // holds its number now.
+  const size_t i = kind == Kind::Close ? addDrop(inst, t0, INT64_MAX, channel, {slot, gen})
+                                       : addDrop(inst, t0, INT64_MAX, -1, {slot, gen});
+  openDrops_[{slot, gen, seq}] = i;
+  dropsOfClient_[{slot, gen}].push_back(i);
+}
+
+void Judge::callEnded(const CallRecord& r) {
+  std::lock_guard<std::mutex> l(mu_);
+  auto it = openDrops_.find({r.slot, r.gen, r.seq});
+  if (it != openDrops_.end()) {
+    drops_[it->second].end = r.t1;  // what an init, a reset or a close does, it does in the call
+    openDrops_.erase(it);
+  }
+  queue_.push_back(r);
+}
+
+void Judge::clientGone(int slot, int gen, Inst inst, int64_t t, bool inCall) {
+  std::lock_guard<std::mutex> l(mu_);
+  for (size_t i : dropsOfClient_[{slot, gen}]) {
+    if (drops_[i].end == INT64_MAX) drops_[i].end = t + kSettleMarginNs;
+  }
+  dropsOfClient_.erase({slot, gen});
+  // eSE1 closes the library on any client's death, and every channel with it.
+  if (inst == Inst::Ese) addDrop(inst, t, t + kSettleMarginNs);
+  if (inCall) ++callsCut_;
+}
+
+std::vector<FaultSpan> Judge::overlapping(Inst inst, int64_t t0, int64_t t1, bool* other) const {
+  const int64_t tail = faultTailMs(bounds_) * kMs;
+  std::vector<FaultSpan> same;
+  *other = false;
+  // Faults are kept in the order they started; none lasts longer than 10 s.
+  for (auto it = faults_.rbegin(); it != faults_.rend(); ++it) {
+    const FaultSpan& s = *it;
+    if (s.start + 10000 * kMs + tail < t0) break;
+    const int64_t end = s.end == INT64_MAX ? INT64_MAX : s.end + tail;
+    if (s.start > t1 || end < t0) continue;
+    if (faultInst(s.fault.kind) == inst) {
+      same.push_back(s);
+    } else {
+      *other = true;
+    }
+  }
+  return same;
+}
+
+bool Judge::channelCertain(const CallRecord& r) const {
+  if (r.inst == Inst::Sim && r.channel == 0) return true;  // the SIM's basic channel keeps its applet
+  if (!r.appletKnown) return false;
+  for (const Drop& d : drops_) {
+    if (d.inst != r.inst || d.start > r.t1 || d.settle < r.openedAt) continue;
+    if (d.channel >= 0 && (d.channel != r.channel || d.by == std::make_pair(r.slot, r.gen))) continue;
+    return false;
+  }
+  return true;
+}
+
+std::string Judge::describe(const CallRecord& r) const {
+  std::string s = std::string(instName(r.inst)) + " " + ifaceName(r.iface) + " " + kindName(r.kind);
+  if (!r.cmd.empty()) s += " " + toHex(r.cmd);
+  if (r.kind == Kind::Open || r.kind == Kind::Basic) s += " P2 " + std::to_string(r.p2);
+  if (r.channel >= 0) s += " on channel " + std::to_string(r.channel);
+  char b[160];
+  snprintf(b, sizeof(b), " (client %d.%d pid %d call %ld, %s to %s, %.1f ms)", r.slot, r.gen, r.pid, r.seq,
+           at(r.t0).c_str(), at(r.t1).c_str(), static_cast<double>(r.t1 - r.t0) / 1e6);
+  return s + b;
+}
+
+void Judge::violation(const std::string& invariant, const CallRecord& r, const std::vector<FaultSpan>& active) {
+  if (++reported_ > shown_) {
+    if (reported_ == shown_ + 1) fprintf(out_, "chaos: (further violations counted, not shown)\n");
+    return;
+  }
+  std::string faults;
+  for (const FaultSpan& s : active) {
+    faults += (faults.empty() ? "" : ", ") + describeFault(s.fault) + " " + at(s.start) + " to " +
+              (s.end == INT64_MAX ? std::string("now") : at(s.end));
+  }
+  fprintf(out_, "chaos: VIOLATION seed %llu at %s: %s\n  call: %s\n  faults active: %s\n",
+          static_cast<unsigned long long>(seed_), at(r.t1).c_str(), invariant.c_str(), describe(r).c_str(),
+          faults.empty() ? "none" : faults.c_str());
+  fflush(out_);
+}
+
+void Judge::judgeUpTo(int64_t horizon) {
+  std::lock_guard<std::mutex> l(mu_);
+  std::sort(queue_.begin(), queue_.end(), [](const CallRecord& a, const CallRecord& b) { return a.t1 < b.t1; });
+  size_t n = 0;
+  while (n < queue_.size() && queue_[n].t1 < horizon) judge(queue_[n++]);
+  queue_.erase(queue_.begin(), queue_.begin() + static_cast<std::ptrdiff_t>(n));
+  // No client lives longer than a minute and a half (chaos_client.cpp), so
+  // no channel was opened before what settled that long ago.
+  const int64_t forget = horizon - 120000 * kMs;
+  if (drops_.size() > pruneAt_) {
+    std::vector<Drop> kept;
+    for (const Drop& d : drops_) {
+      if (d.settle >= forget) kept.push_back(d);
+    }
+    // Indexes held for calls under way point into the old list: remap them.
+    std::map<size_t, size_t> moved;
+    for (size_t i = 0, j = 0; i < drops_.size(); ++i) {
+      if (drops_[i].settle >= forget) moved[i] = j++;
+    }
+    for (auto& e : openDrops_) e.second = moved.count(e.second) ? moved[e.second] : SIZE_MAX;
+    for (auto& e : faultDrops_) e.second = moved.count(e.second) ? moved[e.second] : SIZE_MAX;
+    for (auto& e : dropsOfClient_) {
+      std::vector<size_t> v;
+      for (size_t i : e.second) {
+        if (moved.count(i)) v.push_back(moved[i]);
+      }
+      e.second = v;
+    }
+    drops_.swap(kept);
+    pruneAt_ = std::max<size_t>(2000, 2 * drops_.size());
+  }
+}
+
+void Judge::judge(const CallRecord& r) {
+  bool other = false;
+  const std::vector<FaultSpan> same = overlapping(r.inst, r.t0, r.t1, &other);
+  CallContext c;
+  c.pcsc = pcsc_;
+  c.channelCertain = channelCertain(r);
+  for (const Drop& d : drops_) {
+    if (d.inst == r.inst && d.channel < 0 && d.by.first >= 0 && d.by != std::make_pair(r.slot, r.gen) &&
+        d.start <= r.t1 && d.end >= r.t0) {
+      c.statesShared = true;
+    }
+  }
+  for (const FaultSpan& s : same) {
+    // The library reads its switches on each call: a little either side.
+    const bool during = s.start <= r.t1 + 100 * kMs && (s.end == INT64_MAX || s.end + 100 * kMs >= r.t0);
+    if (!during) continue;
+    if (s.fault.kind == FaultKind::LibFail) {
+      c.libFail = true;
+      if (s.fault.a != 0) c.libFailSw = s.fault.a;
+    }
+    if (s.fault.kind == FaultKind::CardOut) c.cardOut = true;
+  }
+  const Verdict v = classify(r, c);
+  if (r.kind == Kind::Transmit && r.appletKnown) {
+    ++transmits_;
+    if (c.channelCertain) ++transmitsChecked_;
+  }
+
+  std::vector<Fault> weighing;
+  for (const FaultSpan& s : same) weighing.push_back(s.fault);
+  for (Fault& f : weighing) {
+    // Weigh what actually happened, not what was planned.
+    for (const FaultSpan& s : same) {
+      if (s.fault.kind == f.kind && s.fault.startMs == f.startMs) {
+        f.startMs = s.start / kMs;
+        f.endMs = (s.end == INT64_MAX ? r.t1 : s.end) / kMs;
+      }
+    }
+  }
+  const int64_t boundMs = callBoundMs(weighing, other, bounds_);
+  const int64_t tookNs = r.t1 - r.t0;
+
+  Tally& t = tallies_[{r.inst, r.iface}];
+  ++t.calls;
+  ++calls_;
+  switch (v.outcome) {
+    case Outcome::Ok: ++t.ok; break;
+    case Outcome::Clean: ++t.clean; break;
+    case Outcome::Wrong:
+      ++t.wrong;
+      ++wrong_;
+      violation("wrong answer: " + v.why, r, same);
+      break;
+  }
+  if (tookNs > boundMs * kMs) {
+    ++t.over;
+    ++over_;
+    char b[96];
+    snprintf(b, sizeof(b), "over bound: took %.1f ms, bound %lld ms", static_cast<double>(tookNs) / 1e6,
+             static_cast<long long>(boundMs));
+    violation(b, r, same);
+  }
+  // "A fault active": one on either instance while the call ran (the
+  // tails that widen the bound do not count here).
+  bool active = false;
+  for (auto it = faults_.rbegin(); it != faults_.rend() && !active; ++it) {
+    active = it->start <= r.t1 && (it->end == INT64_MAX || it->end >= r.t0);
+    if (it->start + 20000 * kMs < r.t0) break;
+  }
+  Worst& w = worst_[static_cast<int>(r.kind)][active ? 1 : 0];
+  if (tookNs > w.ns) {
+    w.ns = tookNs;
+    w.boundMs = boundMs;
+    w.call = describe(r);
+  }
+
+  if (v.outcome == Outcome::Ok && touchesDevice(r.kind)) {
+    for (Drop& d : drops_) {
+      if (d.inst == r.inst && d.settle == INT64_MAX && d.end < r.t0) d.settle = r.t1;
+    }
+  }
+}
+
+}  // namespace chaos

@@ -1,0 +1,182 @@
+// The chaos soak's schedule and judge: a seed must replay the same run, and
+// the judge must tell a right answer, a documented failure and a wrong one
+// apart (a judge that passes everything would make the soak worthless).
+#include <gtest/gtest.h>
+
+#include <set>
+
+#include "card_applets.h"
+#include "virtual_card.h"
+#include "chaos_check.h"
+#include "chaos_plan.h"
+#include "chaos_record.h"
+
+namespace chaos {
+namespace {
+
+using Bytes = std::vector<uint8_t>;
+
+TEST(ChaosPlan, TheSeedFixesTheWholeScheduleAndFaultsOfOneStreamNeverOverlap) {
+  const Plan a = makePlan(1207, 60000, false), b = makePlan(1207, 60000, false), c = makePlan(1208, 60000, false);
+  ASSERT_EQ(a.faults.size(), b.faults.size());
+  bool differs = a.faults.size() != c.faults.size();
+  for (size_t i = 0; i < a.faults.size(); ++i) {
+    EXPECT_EQ(describeFault(a.faults[i]), describeFault(b.faults[i]));
+    EXPECT_EQ(a.faults[i].startMs, b.faults[i].startMs);
+    EXPECT_EQ(a.faults[i].endMs, b.faults[i].endMs);
+    EXPECT_LE(a.faults[i].endMs, 59000);
+    if (i < c.faults.size()) differs = differs || a.faults[i].startMs != c.faults[i].startMs;
+  }
+  EXPECT_TRUE(differs);
+  ASSERT_EQ(a.kills.size(), b.kills.size());
+  for (size_t i = 0; i < a.kills.size(); ++i) EXPECT_EQ(a.kills[i].atMs, b.kills[i].atMs);
+  EXPECT_EQ(a.clientSeed(3, 7), b.clientSeed(3, 7));
+  EXPECT_NE(a.clientSeed(3, 7), a.clientSeed(3, 8));
+
+  // The modem's outages share one stream: never two at once.
+  auto outage = [](FaultKind k) {
+    return k == FaultKind::ModemSilence || k == FaultKind::ModemPortLost || k == FaultKind::ModemRestart;
+  };
+  int64_t lastEnd = -1;
+  std::set<FaultKind> kinds;
+  for (const Fault& f : makePlan(99, 600000, false).faults) {
+    kinds.insert(f.kind);
+    if (!outage(f.kind)) continue;
+    EXPECT_GT(f.startMs, lastEnd);
+    lastEnd = f.endMs;
+  }
+  EXPECT_EQ(kinds.size(), 10u);  // every kind but the PC/SC card's
+  EXPECT_EQ(makePlan(99, 600000, true).faults.size() > 0, true);
+}
+
+TEST(ChaosRecord, RoundTrip) {
+  CallRecord r;
+  r.slot = 3;
+  r.gen = 2;
+  r.seq = 17;
+  r.kind = Kind::Transmit;
+  r.inst = Inst::Sim;
+  r.iface = Iface::Aidl;
+  r.t0 = 100;
+  r.t1 = 250;
+  r.cmd = {0x01, 0x01, 0x00, 0x00};
+  r.channel = 1;
+  r.appletKnown = true;
+  r.appletAid = se_card::aid::kEcho;
+  r.error = "connection lost to peer";
+  r.status = "SUCCESS";
+  r.data = {0x90, 0x00};
+  CallRecord back;
+  ASSERT_TRUE(decodeRecord(encodeRecord(r), &back));
+  EXPECT_EQ(encodeRecord(back), encodeRecord(r));
+  EXPECT_EQ(back.appletAid, r.appletAid);
+  EXPECT_FALSE(decodeRecord("E slot=1", &back));
+}
+
+CallRecord transmit(Inst inst, Iface iface, const Bytes& cmd, const Bytes& answer, const std::string& status = "") {
+  CallRecord r;
+  r.kind = Kind::Transmit;
+  r.inst = inst;
+  r.iface = iface;
+  r.cmd = cmd;
+  r.channel = 2;
+  r.appletKnown = true;
+  r.appletAid = se_card::aid::kEcho;
+  r.data = answer;
+  r.status = iface == Iface::Aidl && status.empty() ? "SUCCESS" : status;
+  return r;
+}
+
+TEST(ChaosCheck, AnswersAreRightCleanFailuresOrWrong) {
+  const Bytes echo = {0x02, 0x01, 0x00, 0x00, 0x02, 0xAA, 0xBB};
+  const Bytes sw = {0x02, 0x02, 0x6A, 0x82, 0x01, 0xCC};
+  CallContext certain, lost;
+  lost.channelCertain = false;
+  struct Case {
+    const char* what;
+    CallRecord r;
+    CallContext c;
+    Outcome want;
+  } cases[] = {
+      {"echo answered", transmit(Inst::Sim, Iface::Hidl, echo, {0xAA, 0xBB, 0x90, 0x00}), certain, Outcome::Ok},
+      {"status word asked for", transmit(Inst::Ese, Iface::Aidl, sw, {0xCC, 0x6A, 0x82}), certain, Outcome::Ok},
+      {"a wrong byte", transmit(Inst::Sim, Iface::Hidl, echo, {0xAA, 0xBC, 0x90, 0x00}), certain, Outcome::Wrong},
+      {"a wrong status word", transmit(Inst::Ese, Iface::Aidl, sw, {0xCC, 0x90, 0x00}), certain, Outcome::Wrong},
+      {"no status word", transmit(Inst::Ese, Iface::Aidl, echo, {0xAA}), lost, Outcome::Wrong},
+      {"SUCCESS with nothing", transmit(Inst::Sim, Iface::Aidl, echo, {}), certain, Outcome::Wrong},
+      {"eSE1's failure marker", transmit(Inst::Ese, Iface::Hidl, echo, {0x1F}), certain, Outcome::Clean},
+      {"SIM1's failure marker", transmit(Inst::Sim, Iface::Hidl, echo, {}), certain, Outcome::Clean},
+      {"an AIDL error", transmit(Inst::Sim, Iface::Aidl, echo, {}, "CHANNEL_NOT_AVAILABLE"), certain, Outcome::Clean},
+      {"a lost channel's answer", transmit(Inst::Ese, Iface::Hidl, echo, {0x68, 0x81}), lost, Outcome::Clean},
+      {"a transport error", [&] { CallRecord r = transmit(Inst::Ese, Iface::Hidl, echo, {}); r.error = "x"; return r; }(),
+       certain, Outcome::Wrong},
+  };
+  for (const Case& c : cases) EXPECT_EQ(classify(c.r, c.c).outcome, c.want) << c.what;
+  CallContext failing;
+  failing.libFail = true;
+  failing.libFailSw = 0x6F00;
+  EXPECT_EQ(classify(transmit(Inst::Ese, Iface::Aidl, echo, {0x6F, 0x00}), failing).outcome, Outcome::Clean)
+      << "the failed exchange's status word";
+  EXPECT_EQ(classify(transmit(Inst::Ese, Iface::Aidl, echo, {0x6F, 0x00}), certain).outcome, Outcome::Wrong);
+
+  auto call = [](Kind k, Inst inst, Iface iface) {
+    CallRecord r;
+    r.kind = k;
+    r.inst = inst;
+    r.iface = iface;
+    r.status = iface == Iface::Aidl ? "SUCCESS" : "";
+    return r;
+  };
+  CallRecord atr = call(Kind::Atr, Inst::Sim, Iface::Aidl);
+  EXPECT_EQ(classify(atr, certain).outcome, Outcome::Wrong) << "SUCCESS with an empty ATR from SIM1";
+  atr.data = se_card::defaultAtr();
+  EXPECT_EQ(classify(atr, certain).outcome, Outcome::Ok);
+  CallRecord present = call(Kind::Present, Inst::Sim, Iface::Aidl);
+  EXPECT_EQ(classify(present, certain).outcome, Outcome::Wrong) << "SUCCESS with present=false";
+  present.iface = Iface::Hidl;
+  EXPECT_EQ(classify(present, certain).outcome, Outcome::Clean) << "HIDL's failure form";
+
+  CallRecord open = call(Kind::Open, Inst::Sim, Iface::Hidl);
+  open.cmd = {0xA0, 0x00, 0x00, 0x00, 0x01, 0x77};
+  open.status = "SUCCESS";
+  open.resultChannel = 1;
+  EXPECT_EQ(classify(open, certain).outcome, Outcome::Wrong) << "an AID the card lacks opened";
+  open.status = "NO_SUCH_ELEMENT_ERROR";
+  open.resultChannel = 0;
+  EXPECT_EQ(classify(open, certain).outcome, Outcome::Clean);
+  open.resultChannel = 3;
+  EXPECT_EQ(classify(open, certain).outcome, Outcome::Wrong) << "SIM1 fails with channel 0";
+  open.cmd = se_card::aid::kEcho;
+  open.resultChannel = 0;
+  EXPECT_EQ(classify(open, certain).outcome, Outcome::Wrong) << "an installed applet not found";
+
+  CallRecord reset = call(Kind::Reset, Inst::Ese, Iface::Aidl);
+  reset.states = "0";
+  EXPECT_EQ(classify(reset, certain).outcome, Outcome::Wrong);
+  reset.states = "01";
+  EXPECT_EQ(classify(reset, certain).outcome, Outcome::Ok);
+}
+
+TEST(ChaosCheck, TheCardsAnswersFollowTheInstance) {
+  // eSE1 fetches what the card leaves behind 61 xx; SIM1 hands it on.
+  const Bytes big = expectedSelect(Inst::Ese, se_card::aid::kBig, 0);
+  ASSERT_GE(big.size(), 4u);
+  EXPECT_EQ(big[0], 0x6F);
+  EXPECT_EQ(Bytes(big.end() - 2, big.end()), (Bytes{0x90, 0x00}));
+  EXPECT_EQ(expectedSelect(Inst::Sim, se_card::aid::kBig, 0), (Bytes{0x61, static_cast<uint8_t>(big[1] + 2)}));
+  EXPECT_TRUE(expectedSelect(Inst::Sim, {0xA0, 0x01}, 0).empty());
+  EXPECT_EQ(expectedResponse(se_card::aid::kP2Reporter, 0x04, {0x03, 0x20, 0x00, 0x00, 0x01}),
+            (Bytes{0x04, 0x90, 0x00}));
+}
+
+TEST(ChaosCheck, BoundsAddUpTheFaultsAroundACall) {
+  BoundConfig c;
+  Fault silence{FaultKind::ModemSilence, 1000, 3500};
+  Fault bare{FaultKind::ModemBare, 0, 9000};
+  EXPECT_EQ(callBoundMs({}, false, c), c.baseMs);
+  EXPECT_EQ(callBoundMs({silence}, false, c), c.baseMs + 2500 + c.hangMs);
+  EXPECT_EQ(callBoundMs({bare}, true, c), c.baseMs + c.otherInstMs);
+}
+
+}  // namespace
+}  // namespace chaos
