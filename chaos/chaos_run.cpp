@@ -121,7 +121,7 @@ class Run {
   bool startModem() {
     int p[2];
     if (pipe2(p, O_CLOEXEC) != 0) return fail("pipe");
-    const bool ok = modem_.start({o_.binDir + "/modem-sim", "--root", root_ + "/modem", "--log", "/dev/null",
+    const bool ok = modem_.start({o_.binDir + "/modem-sim", "--root", root_ + "/modem", "--log", root_ + "/modem.log",
                                   "--channels-file", root_ + "/modem-channels"},
                                  {}, p[1], root_ + "/modem-sim.err");
     close(p[1]);

@@ -21,8 +21,9 @@ namespace {
 // A waiter looks at the holder's progress at least this often, so that it
 // notices a device call that stops answering while it waits.
 constexpr int64_t kRecheckMicros = 250000;
-// Queued cleanups the device refused are tried again this often.
-constexpr uint64_t kRetryMicros = 1000000;
+// Queued cleanups the device refused are tried again this often, and owners
+// looked at.
+constexpr uint64_t kJanitorMicros = 1000000;
 
 // The gate this thread has been admitted to, and how deeply: an operation
 // that calls another of its own front (init's sweep, the AIDL face calling
@@ -55,8 +56,8 @@ DeviceGate::~DeviceGate() {
     std::lock_guard<std::mutex> g(queueLock_);
     stopping_ = true;
   }
-  retryCv_.notify_all();
-  if (retryThread_.joinable()) retryThread_.join();
+  janitorCv_.notify_all();
+  if (janitor_.joinable()) janitor_.join();
 }
 
 DeviceGate::Pass::Pass(DeviceGate* gate, bool admitted, bool counted, bool wantsDevice)
@@ -178,6 +179,10 @@ void DeviceGate::releaseDevice() {
 void DeviceGate::defer(Cleanup cleanup, const std::string& what, int channel) {
   {
     std::lock_guard<std::mutex> g(queueLock_);
+    // One owed close of a channel is enough, however many callers owe it.
+    for (const Entry& e : queue_) {
+      if (channel >= 0 && e.channel == channel) return;
+    }
     queue_.push_back(Entry{std::move(cleanup), what, false, channel});
   }
   if (pthread_mutex_trylock(config_.lock) == 0) {
@@ -237,46 +242,58 @@ void DeviceGate::drainHeld() {
   }
 
   if (again.empty()) return;
+  std::lock_guard<std::mutex> g(queueLock_);
+  for (Entry& e : again) queue_.push_back(std::move(e));
+  wakeJanitorLocked();
+}
+
+void DeviceGate::wakeJanitorLocked() {
+  if (janitorRunning_ || stopping_ || (queue_.empty() && owners_.empty())) return;
+  janitorRunning_ = true;
+  // The one before has left (it clears the flag as its last step).
+  if (janitor_.joinable()) janitor_.join();
+  janitor_ = std::thread([this] { janitorLoop(); });
+}
+
+bool DeviceGate::janitorHasWork() {
+  std::vector<pid_t> owners;
   {
     std::lock_guard<std::mutex> g(queueLock_);
-    for (Entry& e : again) queue_.push_back(std::move(e));
+    if (!queue_.empty()) return true;
+    for (const auto& o : owners_) owners.push_back(o.second);
   }
-  startRetries();
+  for (pid_t pid : owners) {
+    if (processGone(pid)) return true;
+  }
+  return false;
 }
 
-void DeviceGate::startRetries() {
-  std::lock_guard<std::mutex> g(queueLock_);
-  if (retrying_ || stopping_) return;
-  retrying_ = true;
-  // One thread at a time, and only while something is owed.
-  if (retryThread_.joinable()) retryThread_.join();
-  retryThread_ = std::thread([this] { retryLoop(); });
-}
-
-void DeviceGate::retryLoop() {
-  const auto pause = std::chrono::microseconds(se_delay::scaledMicros(kRetryMicros));
+void DeviceGate::janitorLoop() {
+  const auto pause = std::chrono::microseconds(se_delay::scaledMicros(kJanitorMicros));
   for (;;) {
     {
       std::unique_lock<std::mutex> l(queueLock_);
-      if (retryCv_.wait_for(l, pause, [this] { return stopping_; })) return;
+      janitorCv_.wait_for(l, pause, [this] { return stopping_ || (queue_.empty() && owners_.empty()); });
+      if (stopping_ || (queue_.empty() && owners_.empty())) {
+        janitorRunning_ = false;
+        return;
+      }
     }
-    if (pthread_mutex_trylock(config_.lock) == 0) releaseDevice();
-    std::lock_guard<std::mutex> g(queueLock_);
-    if (queue_.empty() || stopping_) {
-      retrying_ = false;
-      return;
-    }
+    // A caller that has the device drains at its end anyway.
+    if (janitorHasWork() && pthread_mutex_trylock(config_.lock) == 0) releaseDevice();
   }
 }
 
 void DeviceGate::opened(uint8_t channel, pid_t owner) {
   std::lock_guard<std::mutex> g(queueLock_);
   owners_[channel] = owner;
+  wakeJanitorLocked();
 }
 
 void DeviceGate::closed(uint8_t channel) {
   std::lock_guard<std::mutex> g(queueLock_);
   owners_.erase(channel);
+  if (owners_.empty() && queue_.empty()) janitorCv_.notify_all();
 }
 
 void DeviceGate::forgetChannels() {
@@ -285,6 +302,7 @@ void DeviceGate::forgetChannels() {
   for (auto it = queue_.begin(); it != queue_.end();) {
     it = it->channel >= 0 ? queue_.erase(it) : it + 1;
   }
+  if (queue_.empty()) janitorCv_.notify_all();
 }
 
 bool DeviceGate::heldByAnother(uint8_t channel, pid_t caller) const {

@@ -22,8 +22,8 @@
 //   One that fails because the device does not answer stays queued and is
 //   tried again once a second until it runs. Nothing is dropped.
 // - Owners: channels are recorded with the process that opened them. A
-//   client's death, or finding its process gone, queues the close of its
-//   channels.
+//   client's death, or finding its process gone (checked at every call and
+//   once a second while channels are open), closes its channels.
 #include <pthread.h>
 #include <sys/types.h>
 
@@ -67,7 +67,7 @@ class DeviceGate {
   static constexpr int64_t kDefaultHangMillis = 10000;
 
   explicit DeviceGate(Config config);
-  // Waits for the retry thread (the product's gates are never destroyed).
+  // Waits for the janitor thread (the product's gates are never destroyed).
   ~DeviceGate();
   DeviceGate(const DeviceGate&) = delete;
   DeviceGate& operator=(const DeviceGate&) = delete;
@@ -138,8 +138,12 @@ class DeviceGate {
   // With the device held: runs the queue and closes channels of owners whose
   // process is gone.
   void drainHeld();
-  void startRetries();
-  void retryLoop();
+  // The janitor: a thread that lives only while a cleanup is owed or a
+  // channel is open. Once a second it runs what is owed and looks for owners
+  // that went without a death notice (a client that never called init).
+  void wakeJanitorLocked();
+  void janitorLoop();
+  bool janitorHasWork();
   int64_t hangMicros() const;
 
   const Config config_;
@@ -148,10 +152,10 @@ class DeviceGate {
   mutable std::mutex queueLock_;  // guards what follows
   std::deque<Entry> queue_;
   std::map<uint8_t, pid_t> owners_;
-  bool retrying_ = false;  // a retry thread runs
+  bool janitorRunning_ = false;
   bool stopping_ = false;
-  std::condition_variable retryCv_;
-  std::thread retryThread_;
+  std::condition_variable janitorCv_;
+  std::thread janitor_;
 };
 
 // What the caller of the current operation is, and how the operation ended,

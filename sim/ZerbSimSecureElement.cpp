@@ -275,7 +275,7 @@ Return<SecureElementStatus> ZerbSimSecureElement::closeChannel(uint8_t channelNu
     // The caller no longer holds the channel: it is closed as soon as the
     // modem is free, and the caller learns that it was not closed now.
     gate().defer([channelNumber] { return closeQueued(channelNumber); },
-                 "closeChannel " + std::to_string(channelNumber));
+                 "closeChannel " + std::to_string(channelNumber), channelNumber);
     return SecureElementStatus::FAILED;
   }
   return closeHeld(channelNumber, "closeChannel");

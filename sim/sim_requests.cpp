@@ -233,6 +233,9 @@ const char* finalText(const ATResponse* response) {
 
 // Presence by AT^CARDTYPE?: 1 or 0, or -1 when the modem does not know the
 // query (learned for this port).
+// Presence not known: the modem gave no answer.
+constexpr int32_t kPresenceUnknown = -2;
+
 int32_t presenceByCardType(ModemQueries& q) {
   static const char* const kFn = "request_get_card_present";
   ResponseHolder response;
@@ -247,8 +250,10 @@ int32_t presenceByCardType(ModemQueries& q) {
     // Any other final answer (no card, say) comes from a modem that knows it.
     if (err >= 0 && response.get() != nullptr && response.get()->final_response != nullptr) {
       q.cardType = Support::kYes;
+      return 0;
     }
-    return 0;
+    // No answer at all (time-out, port gone): nothing is known of the card.
+    return kPresenceUnknown;
   }
   q.cardType = Support::kYes;
   char* line = response.get()->p_intermediates->text;
@@ -281,6 +286,7 @@ int32_t presenceByPin() {
   int32_t err = at_send_command_singleline("AT+CPIN?", "+CPIN:", response.out());
   if (exchangeOk(err, response.get())) return 1;
   if (err >= 0 && cmeCode(response.get()) == 10) return 0;
+  if (err < 0) return kPresenceUnknown;
   QV_LOGE("%s, AT+CPIN? failed (err %d, %s): card counted as absent", kFn, err,
           finalText(response.get()));
   return 0;
@@ -293,7 +299,9 @@ void request_get_card_present(void) {
   QV_LOGD("%s, enter, g_ulModemId: %d", kFn, static_cast<int32_t>(g_ulModemId));
   ModemQueries& q = queriesOfThisPort();
   int32_t present = q.cardType == Support::kNo ? -1 : presenceByCardType(q);
-  if (present < 0) present = presenceByPin();
+  if (present == -1) present = presenceByPin();
+  // A modem that did not answer leaves presence unknown (below 0): the
+  // front reports a failure, not an absent card.
   g_asyncCmd.param = present;
 }
 
@@ -344,7 +352,11 @@ void request_get_atr(void) {
   }
   size_t n = cardatr ? strlen(cardatr) : 0;
   (void)memset_s(g_asyncCmd.data, sizeof(g_asyncCmd.data), 0, sizeof(g_asyncCmd.data));
-  if (n < 1) {
+  if (q.cardAtr == Support::kNo) {
+    // No ATR query on this modem: an empty ATR is the answer, not a failure.
+    g_asyncCmd.param = 0;
+    g_asyncCmd.datalen = 0;
+  } else if (n < 1) {
     g_asyncCmd.param = 1;
     g_asyncCmd.datalen = 0;
   } else if (n / 2 > ASYNC_CMD_DATA_MAX) {

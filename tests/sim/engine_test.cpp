@@ -232,11 +232,12 @@ TEST_F(Engine, PresenceAndAtrOnAModemWithoutTheVendorQueries) {
       // A modem that knows the query and says no card: no fallback, asked again.
       {REQUEST_GET_CARD_PRESENT, {{"AT^CARDTYPE?", finalLine("+CME ERROR: 10")}}, 0, {"AT^CARDTYPE?"},
        {"AT^CARDTYPE?"}, nullptr},
-      // No ATR query: an empty ATR, not asked again. A bare ERROR is taken
-      // for that only where the presence query is unknown as well.
-      {REQUEST_GET_ATR, {}, 1, {"AT^CARDATR", "AT^CARDTYPE?"}, {},
+      // No ATR query: an empty ATR as the answer (param 0), not asked again.
+      // A bare ERROR is taken for that only where the presence query is
+      // unknown as well.
+      {REQUEST_GET_ATR, {}, 0, {"AT^CARDATR", "AT^CARDTYPE?"}, {},
        "the modem does not know AT^CARDATR (ERROR) and has no other ATR query"},
-      {REQUEST_GET_ATR, {{"AT^CARDATR", finalLine("+CME ERROR: 4")}}, 1, {"AT^CARDATR"}, {}, nullptr},
+      {REQUEST_GET_ATR, {{"AT^CARDATR", finalLine("+CME ERROR: 4")}}, 0, {"AT^CARDATR"}, {}, nullptr},
       {REQUEST_GET_ATR, {{"AT^CARDTYPE?", okLine("^CARDTYPE: 0,0,0")}}, 1, {"AT^CARDATR", "AT^CARDTYPE?"},
        {"AT^CARDATR"}, "request_get_atr:cmd return errno=0"},
   };
@@ -365,6 +366,19 @@ TEST_F(Engine, TimedOutSelectReleasesItsSessionOnceTheModemAnswers) {
   ASSERT_TRUE(waitUntil([] { return session_release_count(0) == 0; }));
   EXPECT_EQ("AT+CCHC=257", modem0_->commands().back());
   EXPECT_TRUE(cap.contains("released modem session 257", kTag));
+}
+
+// A presence query the modem never answers leaves presence unknown (below
+// 0), which the front reports as a failure; an answer of "no card" is 0.
+TEST_F(Engine, PresenceIsUnknownWhenTheModemDoesNotAnswer) {
+  se_delay::setDivisorForTest(1000);  // 600 s become 600 ms
+  startWorker(0);
+  modem0_->setScript([](FakeModem&, const std::string&) {});
+  ASSERT_EQ(0, push(0, REQUEST_GET_CARD_PRESENT, {}));
+  EXPECT_LT(g_asyncCmd.param, 0);
+  modem0_->setScript(scriptOf({{"AT^CARDTYPE?", finalLine("+CME ERROR: 10")}}));
+  ASSERT_EQ(0, push(0, REQUEST_GET_CARD_PRESENT, {}));
+  EXPECT_EQ(0, g_asyncCmd.param);
 }
 
 TEST_F(Engine, FailedSelectClosesTheModemChannel) {
