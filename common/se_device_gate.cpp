@@ -247,8 +247,16 @@ void DeviceGate::drainHeld() {
   wakeJanitorLocked();
 }
 
+bool DeviceGate::janitorNeededLocked() const {
+  if (!queue_.empty()) return true;
+  for (const auto& o : owners_) {
+    if (linked_.count(o.second) == 0) return true;
+  }
+  return false;
+}
+
 void DeviceGate::wakeJanitorLocked() {
-  if (janitorRunning_ || stopping_ || (queue_.empty() && owners_.empty())) return;
+  if (janitorRunning_ || stopping_ || !janitorNeededLocked()) return;
   janitorRunning_ = true;
   // The one before has left (it clears the flag as its last step).
   if (janitor_.joinable()) janitor_.join();
@@ -273,8 +281,8 @@ void DeviceGate::janitorLoop() {
   for (;;) {
     {
       std::unique_lock<std::mutex> l(queueLock_);
-      janitorCv_.wait_for(l, pause, [this] { return stopping_ || (queue_.empty() && owners_.empty()); });
-      if (stopping_ || (queue_.empty() && owners_.empty())) {
+      janitorCv_.wait_for(l, pause, [this] { return stopping_ || !janitorNeededLocked(); });
+      if (stopping_ || !janitorNeededLocked()) {
         janitorRunning_ = false;
         return;
       }
@@ -293,7 +301,13 @@ void DeviceGate::opened(uint8_t channel, pid_t owner) {
 void DeviceGate::closed(uint8_t channel) {
   std::lock_guard<std::mutex> g(queueLock_);
   owners_.erase(channel);
-  if (owners_.empty() && queue_.empty()) janitorCv_.notify_all();
+  if (!janitorNeededLocked()) janitorCv_.notify_all();
+}
+
+void DeviceGate::linked(pid_t client) {
+  std::lock_guard<std::mutex> g(queueLock_);
+  linked_.insert(client);
+  if (!janitorNeededLocked()) janitorCv_.notify_all();
 }
 
 void DeviceGate::forgetChannels() {
@@ -302,7 +316,7 @@ void DeviceGate::forgetChannels() {
   for (auto it = queue_.begin(); it != queue_.end();) {
     it = it->channel >= 0 ? queue_.erase(it) : it + 1;
   }
-  if (queue_.empty()) janitorCv_.notify_all();
+  if (!janitorNeededLocked()) janitorCv_.notify_all();
 }
 
 bool DeviceGate::heldByAnother(uint8_t channel, pid_t caller) const {
@@ -315,6 +329,7 @@ void DeviceGate::clientDied(pid_t owner) {
   std::vector<uint8_t> channels;
   {
     std::lock_guard<std::mutex> g(queueLock_);
+    linked_.erase(owner);
     for (const auto& o : owners_) {
       if (o.second == owner) channels.push_back(o.first);
     }

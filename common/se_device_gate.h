@@ -22,8 +22,9 @@
 //   One that fails because the device does not answer stays queued and is
 //   tried again once a second until it runs. Nothing is dropped.
 // - Owners: channels are recorded with the process that opened them. A
-//   client's death, or finding its process gone (checked at every call and
-//   once a second while channels are open), closes its channels.
+//   client's death closes its channels; so does finding its process gone,
+//   checked at every call and, for clients without a death link (they never
+//   called init), once a second while they hold channels.
 #include <pthread.h>
 #include <sys/types.h>
 
@@ -33,6 +34,7 @@
 #include <deque>
 #include <functional>
 #include <map>
+#include <set>
 #include <mutex>
 #include <string>
 #include <thread>
@@ -115,6 +117,9 @@ class DeviceGate {
   // The device dropped every channel (the eSE library closed): owners and
   // queued channel closes go.
   void forgetChannels();
+  // `client` has a death link: its death will be told, so its channels need
+  // no looking after.
+  void linked(pid_t client);
   // Queues the close of every channel `owner` opened; never waits.
   void clientDied(pid_t owner);
   // Whether `channel` belongs to a live client other than `caller`: an
@@ -144,6 +149,9 @@ class DeviceGate {
   void wakeJanitorLocked();
   void janitorLoop();
   bool janitorHasWork();
+  // Whether the janitor has anything to look after: owed cleanups, or
+  // channels of clients that have no death link. queueLock_ held.
+  bool janitorNeededLocked() const;
   int64_t hangMicros() const;
 
   const Config config_;
@@ -152,6 +160,7 @@ class DeviceGate {
   mutable std::mutex queueLock_;  // guards what follows
   std::deque<Entry> queue_;
   std::map<uint8_t, pid_t> owners_;
+  std::set<pid_t> linked_;
   bool janitorRunning_ = false;
   bool stopping_ = false;
   std::condition_variable janitorCv_;

@@ -262,15 +262,19 @@ Return<void> SecureElement::init(const sp<ISecureElementHalCallback>& clientCall
   {
     DeviceGate::Pass pass = gate().enter("init");
     if (!pass.ok()) return Void();
-    clientCallback->linkToDeath(sp<hidl_death_recipient>(this), 0);
+    // The cookie names the client: its death is told, so the channels it
+    // opens need no looking after until then.
+    const pid_t client = se_call::callerPid();
+    Return<bool> linked =
+        clientCallback->linkToDeath(sp<hidl_death_recipient>(this), static_cast<uint64_t>(client));
+    if (linked.isOk() && static_cast<bool>(linked)) gate().linked(client);
 
     // Channels left open by a client that went away are closed once the eSE
     // says it is ready; channel 0 is the basic channel and never closed, nor
     // is a channel another client still holds.
-    const pid_t caller = se_call::callerPid();
     if (lib::readyStatus() == 0) {
       for (uint8_t c = 1; c < kTrackedChannels; ++c) {
-        if (g_openedChannels[c].load() == 1 && !gate().heldByAnother(c, caller) &&
+        if (g_openedChannels[c].load() == 1 && !gate().heldByAnother(c, client) &&
             closeTracked(c, "internalCloseChannel") == CloseResult::kLibraryFailed) {
           closeLater(c, "init");
         }
@@ -644,7 +648,7 @@ bool SecureElement::isLogicalChannelOpen(uint8_t channelNumber) {
          g_openedChannels[channelNumber].load() == 1;
 }
 
-void SecureElement::serviceDied(uint64_t /*cookie*/, const wp<IBase>& /*who*/) {
+void SecureElement::serviceDied(uint64_t cookie, const wp<IBase>& /*who*/) {
   __android_log_print(ANDROID_LOG_ERROR, kTag, "%s enter!", "serviceDied");
   // Death notices come on a pool thread; one must not wait behind a library
   // call that may never return: the close runs as soon as the library is
@@ -656,6 +660,8 @@ void SecureElement::serviceDied(uint64_t /*cookie*/, const wp<IBase>& /*who*/) {
         return DeviceGate::Outcome::kDone;
       },
       "serviceDied, phQvEse_close");
+  // Its channels went with the close; the client is no longer linked.
+  if (cookie != 0) gate().clientDied(static_cast<pid_t>(cookie));
 }
 
 }  // namespace implementation

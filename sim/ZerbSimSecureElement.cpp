@@ -135,14 +135,15 @@ Return<void> ZerbSimSecureElement::init(const sp<ISecureElementHalCallback>& cli
   DeviceGate::Pass pass = gate().admit("init");
   if (!pass.ok()) return Void();
   // The cookie names the client, so that its death closes its channels.
-  (void)clientCallback->linkToDeath(this, static_cast<uint64_t>(se_call::callerPid()));
+  const pid_t client = se_call::callerPid();
+  Return<bool> linked = clientCallback->linkToDeath(this, static_cast<uint64_t>(client));
+  if (linked.isOk() && static_cast<bool>(linked)) gate().linked(client);
 
   // Channels 1 and 2 are left alone: the sweep starts at 3. So are channels
   // another client still holds: the sweep is for channels left behind. A
   // close that cannot be made now is queued by closeChannel and made later.
-  const pid_t caller = se_call::callerPid();
   for (uint8_t channel = 3; channel < SIM_CHANNEL_MAX; channel++) {
-    if (g_simOpenedChannels[channel] != 0 && !gate().heldByAnother(channel, caller)) {
+    if (g_simOpenedChannels[channel] != 0 && !gate().heldByAnother(channel, client)) {
       (void)closeChannel(channel);
     }
   }

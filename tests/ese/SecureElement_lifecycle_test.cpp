@@ -37,7 +37,9 @@ TEST_F(EseLifecycle, InitOpensTheEseAndReportsOnlyASuccessfulOpen) {
   EXPECT_EQ(fake_ese::calls(), (Calls{"status", "open", "status", "open", "status", "open"}));
   EXPECT_EQ(client->connected.load(), 2);
   EXPECT_EQ(client->disconnected.load(), 0);
-  EXPECT_EQ(client->linkCookies, (std::vector<uint64_t>{0, 0, 0}));
+  // The cookie names the client (here this process), whose death it reports.
+  const uint64_t self = static_cast<uint64_t>(getpid());
+  EXPECT_EQ(client->linkCookies, (std::vector<uint64_t>{self, self, self}));
   EXPECT_EQ(client->linkRecipients[0].get(), static_cast<hidl_death_recipient*>(se.get()));
   EXPECT_TRUE(logged(cap, "init enter!", ANDROID_LOG_INFO));
   EXPECT_TRUE(logged(cap, "phQvEse_init_open FAIL", ANDROID_LOG_ERROR));
