@@ -232,6 +232,7 @@ void ModemRelay::fromDaemon() {
     if (buf[i] == '\r') {
       ++pending_;
       ++commands_;
+      if (modem_ < 0) ++dropped_;
     }
   }
   lineOpen_ = buf[n - 1] != '\r' && buf[n - 1] != '\n';

@@ -42,6 +42,9 @@ class ModemRelay {
   bool reconnectModem(const std::string& modemPort, std::string* error);
 
   long commands() const { return commands_; }
+  // Commands that found no modem behind the relay (modem-sim gone outside a
+  // restart): a fault of the soak itself, which the daemon would wait out.
+  long dropped() const { return dropped_; }
 
  private:
   struct Chunk {
@@ -84,6 +87,7 @@ class ModemRelay {
   std::deque<Chunk> out_;
   unsigned unsolTurn_ = 0;
   std::atomic<long> commands_{0};
+  std::atomic<long> dropped_{0};
 };
 
 }  // namespace chaos

@@ -415,6 +415,24 @@ class Run {
       judge_->faultEnded(plan_.faults[i], t);
       logf(t, "end   %s (stopped)", describeFault(plan_.faults[i]).c_str());
     }
+    // A program is sent its parent-death signal when the thread that started
+    // it ends, not the process: the modem-sim or card-vpcd this thread
+    // restarted would be killed with it. So it stays until the run is torn
+    // down, after those programs were stopped.
+    std::unique_lock<std::mutex> l(faultMu_);
+    faultsHealed_ = true;
+    faultCv_.notify_all();
+    faultCv_.wait(l, [&] { return faultExit_; });
+  }
+
+  void endFaultThread() {
+    if (!faults_.joinable()) return;
+    {
+      std::lock_guard<std::mutex> l(faultMu_);
+      faultStop_ = faultExit_ = true;
+    }
+    faultCv_.notify_all();
+    faults_.join();
   }
 
   // ---------------------------------------------------------------- phases
@@ -426,7 +444,7 @@ class Run {
       slots_.push_back(std::move(s));
     }
     rng_.seed(plan_.clientSeed(-1, 0));
-    std::thread faults([this] { faultThread(); });
+    faults_ = std::thread([this] { faultThread(); });
     const int64_t end = origin_ + int64_t(o_.seconds) * 1000 * kMs;
     size_t nextKill = 0;
     int64_t nextNote = origin_ + 30000 * kMs;
@@ -459,11 +477,11 @@ class Run {
       }
     }
     {
-      std::lock_guard<std::mutex> l(faultMu_);
+      std::unique_lock<std::mutex> l(faultMu_);
       faultStop_ = true;
+      faultCv_.notify_all();
+      faultCv_.wait(l, [&] { return faultsHealed_; });
     }
-    faultCv_.notify_all();
-    faults.join();
     // Every client goes; their deaths are the daemon's to handle.
     const int64_t now = monoNanos();
     for (auto& s : slots_) {
@@ -538,6 +556,10 @@ class Run {
         healthy = false;
       }
     }
+    if (relay_.dropped() > 0) {
+      printf("chaos: SOAK FAULT: %ld command(s) reached the relay with no modem-sim behind it\n", relay_.dropped());
+      healthy = false;
+    }
     if (g_stop) printf("chaos: interrupted\n");
     printReport(stdout, *judge_, sum);
     const bool pass = healthy && !g_stop && judge_->wrong() == 0 && judge_->over() == 0 && open == 0;
@@ -577,6 +599,7 @@ class Run {
     relay_.stop();
     modem_.stop();
     pcsc_.reset();
+    endFaultThread();
     if (log_) fclose(log_);
     log_ = nullptr;
     std::error_code ec;
@@ -606,6 +629,9 @@ class Run {
   std::mutex faultMu_;
   std::condition_variable faultCv_;
   bool faultStop_ = false;
+  bool faultsHealed_ = false;
+  bool faultExit_ = false;
+  std::thread faults_;
 };
 
 }  // namespace
