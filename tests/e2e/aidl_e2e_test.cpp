@@ -12,6 +12,8 @@
 #include <signal.h>
 #include <stdlib.h>
 
+#include <future>
+#include <chrono>
 #include <memory>
 #include <mutex>
 #include <string>
@@ -353,6 +355,46 @@ TEST_F(AidlEndToEnd, TheBasicChannelBelongsToItsClient) {
   owner.reset();
   EXPECT_EQ(field(other.call(open), "status"), "SUCCESS");
   EXPECT_EQ(field(other.call(echoCommand(0, "A3")), "response"), "A39000");
+}
+
+// Clients whose callback never answers hold a pool thread each only until
+// the daemon gives up on the callback (5 s) and drops them as dead; another
+// client is served all the while.
+TEST_F(AidlEndToEnd, ClientsThatNeverAnswerACallbackDoNotStopAThird) {
+  ASSERT_NO_FATAL_FAILURE(start());
+  struct Mute : BnSecureElementCallback {
+    explicit Mute(std::shared_future<void> until) : until_(std::move(until)) {}
+    ScopedAStatus onStateChange(bool, const std::string&) override {
+      until_.wait();
+      return ScopedAStatus::ok();
+    }
+    std::shared_future<void> until_;
+  };
+  std::promise<void> release;
+  std::shared_future<void> released = release.get_future().share();
+  std::shared_ptr<void> unblock(nullptr, [&](void*) { release.set_value(); });
+  std::vector<std::future<ScopedAStatus>> mute;
+  for (int i = 0; i < 2; i++) {
+    mute.push_back(std::async(std::launch::async, [&, released] {
+      Client c("eSE1");
+      return c.se->init(::ndk::SharedRefBase::make<Mute>(released));
+    }));
+  }
+  ASSERT_TRUE(daemon->err().waitFor("phQvEse_init_open: open"));
+  const auto t0 = std::chrono::steady_clock::now();
+  SecliSession other(root, "eSE1", {"--aidl"});
+  ASSERT_EQ(field(other.call("init"), "status"), "SUCCESS");
+  EXPECT_EQ(echo(other, openEcho(other), "3C"), "3C9000");
+  EXPECT_LT(msSince(t0), 4000);
+  EXPECT_TRUE(daemon->err().waitFor("did not answer a callback within 5000 ms: dropped as dead"));
+  // Their deaths closed the eSE library, as any client's death does: the
+  // client left opens it again and is served.
+  ASSERT_EQ(field(other.call("init"), "status"), "SUCCESS");
+  EXPECT_EQ(echo(other, openEcho(other), "3D"), "3D9000");
+  // The mute clients' own calls come back once their callbacks return: the
+  // daemon has let them go.
+  unblock.reset();
+  for (auto& f : mute) EXPECT_FALSE(f.get().isOk());
 }
 
 }  // namespace
