@@ -34,15 +34,6 @@ thread_local int tlDepth = 0;
 thread_local pid_t tlCaller = 0;
 thread_local bool tlFailed = false;
 
-struct timespec monotonicIn(int64_t micros) {
-  struct timespec t;
-  clock_gettime(CLOCK_MONOTONIC, &t);
-  const int64_t ns = static_cast<int64_t>(t.tv_nsec) + (micros % 1000000) * 1000;
-  t.tv_sec += static_cast<time_t>(micros / 1000000 + ns / 1000000000);
-  t.tv_nsec = static_cast<long>(ns % 1000000000);
-  return t;
-}
-
 bool processGone(pid_t pid) { return pid > 0 && kill(pid, 0) != 0 && errno == ESRCH; }
 
 }  // namespace
@@ -57,7 +48,8 @@ DeviceGate::~DeviceGate() {
     stopping_ = true;
   }
   janitorCv_.notify_all();
-  if (janitor_.joinable()) janitor_.join();
+  std::unique_lock<std::mutex> l(queueLock_);
+  janitorCv_.wait(l, [this] { return !janitorRunning_; });
 }
 
 DeviceGate::Pass::Pass(DeviceGate* gate, bool admitted, bool counted, bool wantsDevice)
@@ -132,30 +124,40 @@ int64_t DeviceGate::hangMicros() const {
   return static_cast<int64_t>(ms) * 1000;
 }
 
+bool DeviceGate::tryAcquire() {
+  {
+    std::lock_guard<std::mutex> g(queueLock_);
+    if (busy_) return false;
+    busy_ = true;
+  }
+  // Only the holder of busy_ takes the front's lock: it never waits here.
+  pthread_mutex_lock(config_.lock);
+  return true;
+}
+
 bool DeviceGate::acquire(const char* op) {
-  if (pthread_mutex_trylock(config_.lock) != 0) {
-    GATE_LOG(ANDROID_LOG_DEBUG, "%s, %s busy: waiting (%zu callers)", op, config_.device,
-             callers_.load());
-    for (;;) {
+  {
+    std::unique_lock<std::mutex> l(queueLock_);
+    if (busy_) {
+      GATE_LOG(ANDROID_LOG_DEBUG, "%s, %s busy: waiting (%zu callers)", op, config_.device,
+               callers_.load());
+    }
+    while (busy_) {
       const int64_t bound = hangMicros();
       const int64_t silent = config_.silence();
       if (silent >= bound) {
+        l.unlock();
         GATE_LOG(ANDROID_LOG_ERROR, "%s, %s without progress for %lld ms: call given up", op,
                  config_.device, static_cast<long long>(silent / 1000));
         se_call::markFailed();
         return false;
       }
       const int64_t wait = bound - silent < kRecheckMicros ? bound - silent : kRecheckMicros;
-      const struct timespec deadline = monotonicIn(wait);
-      const int rc = pthread_mutex_clocklock(config_.lock, CLOCK_MONOTONIC, &deadline);
-      if (rc == 0) break;
-      if (rc != ETIMEDOUT) {
-        GATE_LOG(ANDROID_LOG_ERROR, "%s, %s lock failed: %d", op, config_.device, rc);
-        se_call::markFailed();
-        return false;
-      }
+      waitCv_.wait_for(l, std::chrono::microseconds(wait));
     }
+    busy_ = true;
   }
+  pthread_mutex_lock(config_.lock);
   drainHeld();
   return true;
 }
@@ -165,14 +167,16 @@ void DeviceGate::releaseDevice() {
     drainHeld();
     pthread_mutex_unlock(config_.lock);
     {
-      // A cleanup queued after the drain by a thread that found the lock
-      // taken is this thread's to run: that thread did not wait for it.
       std::lock_guard<std::mutex> g(queueLock_);
+      busy_ = false;
+      waitCv_.notify_one();
+      // A cleanup queued after the drain by a thread that found the device
+      // taken is this thread's to run: that thread did not wait for it.
       bool fresh = false;
       for (const Entry& e : queue_) fresh = fresh || !e.retried;
       if (!fresh) return;
     }
-    if (pthread_mutex_trylock(config_.lock) != 0) return;  // its holder runs them
+    if (!tryAcquire()) return;  // its holder runs them
   }
 }
 
@@ -185,7 +189,7 @@ void DeviceGate::defer(Cleanup cleanup, const std::string& what, int channel) {
     }
     queue_.push_back(Entry{std::move(cleanup), what, false, channel});
   }
-  if (pthread_mutex_trylock(config_.lock) == 0) {
+  if (tryAcquire()) {
     releaseDevice();
     return;
   }
@@ -258,9 +262,9 @@ bool DeviceGate::janitorNeededLocked() const {
 void DeviceGate::wakeJanitorLocked() {
   if (janitorRunning_ || stopping_ || !janitorNeededLocked()) return;
   janitorRunning_ = true;
-  // The one before has left (it clears the flag as its last step).
-  if (janitor_.joinable()) janitor_.join();
-  janitor_ = std::thread([this] { janitorLoop(); });
+  // Detached: it clears the flag under the lock as its last step, which is
+  // what the destructor waits for.
+  std::thread([this] { janitorLoop(); }).detach();
 }
 
 bool DeviceGate::janitorHasWork() {
@@ -284,11 +288,12 @@ void DeviceGate::janitorLoop() {
       janitorCv_.wait_for(l, pause, [this] { return stopping_ || !janitorNeededLocked(); });
       if (stopping_ || !janitorNeededLocked()) {
         janitorRunning_ = false;
+        janitorCv_.notify_all();
         return;
       }
     }
     // A caller that has the device drains at its end anyway.
-    if (janitorHasWork() && pthread_mutex_trylock(config_.lock) == 0) releaseDevice();
+    if (janitorHasWork() && tryAcquire()) releaseDevice();
   }
 }
 

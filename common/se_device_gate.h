@@ -59,7 +59,8 @@ class DeviceGate {
     const char* device;        // the instance's name, for log lines
     int logBuffer;             // LOG_ID_MAIN or LOG_ID_RADIO
     const char* tag;           // the front's log tag
-    pthread_mutex_t* lock;     // the front's own lock: held while the device is in use
+    pthread_mutex_t* lock;     // the front's own lock: held while the device is in use,
+                               // taken only by the caller the gate lets in
     size_t maxCallers;         // admission limit
     const char* hangProperty;  // property holding the hang bound in ms
     SilenceFn silence;
@@ -138,6 +139,8 @@ class DeviceGate {
   };
 
   bool admitOne(const char* op);
+  // The device for this thread without waiting; false when another has it.
+  bool tryAcquire();
   bool acquire(const char* op);
   void releaseDevice();
   // With the device held: runs the queue and closes channels of owners whose
@@ -158,13 +161,15 @@ class DeviceGate {
   std::atomic<size_t> callers_{0};
 
   mutable std::mutex queueLock_;  // guards what follows
+  // Whether a caller has the device; it also holds the front's lock then.
+  bool busy_ = false;
+  std::condition_variable waitCv_;  // the device let go
   std::deque<Entry> queue_;
   std::map<uint8_t, pid_t> owners_;
   std::set<pid_t> linked_;
   bool janitorRunning_ = false;
   bool stopping_ = false;
   std::condition_variable janitorCv_;
-  std::thread janitor_;
 };
 
 // What the caller of the current operation is, and how the operation ended,

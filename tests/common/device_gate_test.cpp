@@ -190,8 +190,9 @@ TEST_F(Gate, QueuedCleanupsRunBeforeTheNextCallerAndRetryUntilDone) {
   // A cleanup the device refuses is tried again, once a second, until done.
   std::atomic<int> tries{0};
   gate().defer([&] {
+    const int n = ++tries;
     journal_.add("try");
-    return ++tries < 3 ? Outcome::kRetry : Outcome::kDone;
+    return n < 3 ? Outcome::kRetry : Outcome::kDone;
   }, "stubborn");
   ASSERT_TRUE(journal_.waitFor(6));
   EXPECT_EQ(tries.load(), 3);
