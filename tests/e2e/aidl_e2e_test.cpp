@@ -386,7 +386,11 @@ TEST_F(AidlEndToEnd, ClientsThatNeverAnswerACallbackDoNotStopAThird) {
   ASSERT_EQ(field(other.call("init"), "status"), "SUCCESS");
   EXPECT_EQ(echo(other, openEcho(other), "3C"), "3C9000");
   EXPECT_LT(msSince(t0), 4000);
-  EXPECT_TRUE(daemon->err().waitFor("did not answer a callback within 5000 ms: dropped as dead"));
+  const std::string dropped = "did not answer a callback within 5000 ms: dropped as dead";
+  ASSERT_TRUE(daemon->err().waitFor(dropped));
+  ASSERT_TRUE(daemon->err().waitFor(dropped, daemon->err().text().find(dropped) + 1));
+  const size_t second = daemon->err().text().rfind(dropped);
+  EXPECT_TRUE(daemon->err().waitFor("phQvEse_close: closed", second));
   // Their deaths closed the eSE library, as any client's death does: the
   // client left opens it again and is served.
   ASSERT_EQ(field(other.call("init"), "status"), "SUCCESS");
