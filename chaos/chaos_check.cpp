@@ -240,9 +240,10 @@ int64_t faultAllowanceMs(const Fault& f, const BoundConfig& c) {
   switch (f.kind) {
     case FaultKind::ModemSilence:
     case FaultKind::LibHang:
-      // The call in flight waits out the silence; those queued give up after
-      // the hang bound without progress.
-      return len + c.hangMs;
+      // The call in flight waits out the silence; those behind it give up
+      // once it has gone the hang bound without progress, later ones at once
+      // ("Failure model").
+      return std::max(len, c.hangMs);
     case FaultKind::ModemSlow:
       return kCalls * kCommands * f.a;
     case FaultKind::ModemPieces: {

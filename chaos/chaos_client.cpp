@@ -348,7 +348,7 @@ class Client {
     const uint8_t p2 = between(0, 1) ? 0x04 : 0x00;
     CallRecord r = doCall(Kind::Open, aid, p2);
     if (r.error.empty() && r.status == "SUCCESS" && r.resultChannel >= 1 && r.resultChannel <= 19) {
-      channels_.push_back({r.resultChannel, aid, p2, r.t0});
+      hold({r.resultChannel, aid, p2, r.t0});
     }
   }
 
@@ -363,7 +363,20 @@ class Client {
     const Bytes aid = between(0, 1) ? se_card::aid::kEcho : Bytes();
     CallRecord r = doCall(Kind::Basic, aid, 0);
     // What the basic channel holds is anyone's guess once others select there.
-    if (r.error.empty() && r.status == "SUCCESS") channels_.push_back({0, {}, 0, r.t0});
+    if (r.error.empty() && r.status == "SUCCESS") hold({0, {}, 0, r.t0});
+  }
+
+  // A number the element hands out again is free there: the channel this
+  // client held under it was taken away (a reset, an init, a death), and a
+  // close of that one would now close the new one.
+  void hold(const OpenChannel& ch) {
+    for (size_t i = 0; i < channels_.size(); ++i) {
+      if (channels_[i].number == ch.number) {
+        channels_.erase(channels_.begin() + static_cast<std::ptrdiff_t>(i));
+        break;
+      }
+    }
+    channels_.push_back(ch);
   }
 
   void transmit() {

@@ -112,6 +112,12 @@ Health healthOf(pid_t pid) {
     closedir(d);
     h.fds = n;
   }
+  if (DIR* d = opendir((base + "/task").c_str())) {
+    while (dirent* e = readdir(d)) {
+      if (e->d_name[0] != '.') h.tids.push_back(strtol(e->d_name, nullptr, 10));
+    }
+    closedir(d);
+  }
   return h;
 }
 

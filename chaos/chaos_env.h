@@ -53,6 +53,7 @@ struct Health {
   long rssKb = -1;
   long fds = -1;
   long threads = -1;
+  std::vector<long> tids;  // the threads' ids, as the daemon's log lines show them
 };
 Health healthOf(pid_t pid);
 

@@ -87,7 +87,11 @@ void Judge::callEnded(const CallRecord& r) {
 void Judge::clientGone(int slot, int gen, Inst inst, int64_t t, bool inCall) {
   std::lock_guard<std::mutex> l(mu_);
   for (size_t i : dropsOfClient_[{slot, gen}]) {
-    if (drops_[i].end == INT64_MAX) drops_[i].end = t + kSettleMarginNs;
+    Drop& d = drops_[i];
+    if (d.end != INT64_MAX) continue;
+    // The daemon carries on with the call its client died in (a reset goes
+    // on closing channels): it ends within the bound it would have had.
+    d.end = std::max(t, d.start + boundMsFor(d.inst, d.start, t) * kMs) + kSettleMarginNs;
   }
   dropsOfClient_.erase({slot, gen});
   // eSE1 closes the library on any client's death, and every channel with it.
@@ -114,6 +118,20 @@ std::vector<FaultSpan> Judge::overlapping(Inst inst, int64_t t0, int64_t t1, boo
   return same;
 }
 
+int64_t Judge::boundMsFor(Inst inst, int64_t t0, int64_t t1) const {
+  bool other = false;
+  const std::vector<FaultSpan> same = overlapping(inst, t0, t1, &other);
+  std::vector<Fault> weighing;
+  for (const FaultSpan& s : same) {
+    // Weigh what actually happened, not what was planned.
+    Fault f = s.fault;
+    f.startMs = s.start / kMs;
+    f.endMs = (s.end == INT64_MAX ? t1 : s.end) / kMs;
+    weighing.push_back(f);
+  }
+  return callBoundMs(weighing, other, bounds_);
+}
+
 bool Judge::channelCertain(const CallRecord& r) const {
   if (r.inst == Inst::Sim && r.channel == 0) return true;  // the SIM's basic channel keeps its applet
   if (!r.appletKnown) return false;
@@ -130,6 +148,7 @@ std::string Judge::describe(const CallRecord& r) const {
   if (!r.cmd.empty()) s += " " + toHex(r.cmd);
   if (r.kind == Kind::Open || r.kind == Kind::Basic) s += " P2 " + std::to_string(r.p2);
   if (r.channel >= 0) s += " on channel " + std::to_string(r.channel);
+  if (r.channel >= 0 && r.appletKnown) s += " (opened " + at(r.openedAt) + ")";
   char b[160];
   snprintf(b, sizeof(b), " (client %d.%d pid %d call %ld, %s to %s, %.1f ms)", r.slot, r.gen, r.pid, r.seq,
            at(r.t0).c_str(), at(r.t1).c_str(), static_cast<double>(r.t1 - r.t0) / 1e6);
@@ -208,23 +227,19 @@ void Judge::judge(const CallRecord& r) {
     if (s.fault.kind == FaultKind::CardOut) c.cardOut = true;
   }
   const Verdict v = classify(r, c);
+  if (trace_ != nullptr) {
+    std::string result = r.error.empty() ? r.status : "error " + r.error;
+    if (r.kind == Kind::Open && r.resultChannel >= 0) result += " channel " + std::to_string(r.resultChannel);
+    if (!r.data.empty()) result += " " + (r.data.size() > 24 ? toHex({r.data.begin(), r.data.begin() + 24}) + "..." : toHex(r.data));
+    fprintf(trace_, "%s -> %s: %s%s%s%s\n", describe(r).c_str(), result.empty() ? "-" : result.c_str(),
+            outcomeName(v.outcome), v.why.empty() ? "" : " (", v.why.c_str(), v.why.empty() ? "" : ")");
+  }
   if (r.kind == Kind::Transmit && r.appletKnown) {
     ++transmits_;
     if (c.channelCertain) ++transmitsChecked_;
   }
 
-  std::vector<Fault> weighing;
-  for (const FaultSpan& s : same) weighing.push_back(s.fault);
-  for (Fault& f : weighing) {
-    // Weigh what actually happened, not what was planned.
-    for (const FaultSpan& s : same) {
-      if (s.fault.kind == f.kind && s.fault.startMs == f.startMs) {
-        f.startMs = s.start / kMs;
-        f.endMs = (s.end == INT64_MAX ? r.t1 : s.end) / kMs;
-      }
-    }
-  }
-  const int64_t boundMs = callBoundMs(weighing, other, bounds_);
+  const int64_t boundMs = boundMsFor(r.inst, r.t0, r.t1);
   const int64_t tookNs = r.t1 - r.t0;
 
   Tally& t = tallies_[{r.inst, r.iface}];

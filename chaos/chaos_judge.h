@@ -52,6 +52,9 @@ class Judge {
   // Judges the calls that ended before `horizon`.
   void judgeUpTo(int64_t horizon);
 
+  // Every judged call, one line each, in the order judged (nullptr: none).
+  void traceTo(FILE* trace) { trace_ = trace; }
+
   const std::map<std::pair<Inst, Iface>, Tally>& tallies() const { return tallies_; }
   long wrong() const { return wrong_; }
   long over() const { return over_; }
@@ -82,6 +85,8 @@ class Judge {
 
   void judge(const CallRecord& r);
   std::vector<FaultSpan> overlapping(Inst inst, int64_t t0, int64_t t1, bool* other) const;
+  // The bound of a call on `inst` from t0 to t1, given the faults around it.
+  int64_t boundMsFor(Inst inst, int64_t t0, int64_t t1) const;
   bool channelCertain(const CallRecord& r) const;
   size_t addDrop(Inst inst, int64_t start, int64_t end, int channel = -1, std::pair<int, int> by = {-1, -1});
   std::string describe(const CallRecord& r) const;
@@ -92,6 +97,7 @@ class Judge {
   bool pcsc_;
   int64_t origin_;
   FILE* out_;
+  FILE* trace_ = nullptr;
 
   mutable std::mutex mu_;  // the fault thread and the main thread
   std::vector<FaultSpan> faults_;

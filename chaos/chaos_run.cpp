@@ -49,6 +49,7 @@ struct SlotState {
   int fd = -1;
   std::string buf;
   bool inCall = false;
+  Kind callKind = Kind::Init;  // the call under way, while inCall
   bool killed = false;
   int64_t respawnAt = 0;
   int64_t killBy = 0;  // kill at the next call start, or at this time
@@ -74,6 +75,16 @@ class Run {
     start_ = healthOf(daemon_.pid());
     origin_ = monoNanos();
     judge_ = std::make_unique<Judge>(o_.seed, bounds_, o_.pcsc, origin_, stdout, o_.shown);
+    calls_ = fopen((root_ + "/calls.log").c_str(), "w");
+    judge_->traceTo(calls_);
+    {
+      // The daemon's and modem-sim's logs carry the wall clock.
+      struct timespec wall;
+      clock_gettime(CLOCK_REALTIME, &wall);
+      struct tm tm;
+      localtime_r(&wall.tv_sec, &tm);
+      logf(origin_, "start: wall clock %02d:%02d:%02d.%03ld", tm.tm_hour, tm.tm_min, tm.tm_sec, wall.tv_nsec / 1000000);
+    }
     chaosPhase();
     return finish(true);
   }
@@ -260,7 +271,10 @@ class Run {
       char kind[16] = {0};
       if (sscanf(line.c_str(), "S %d %d %ld %15s %lld %d", &slot, &gen, &seq, kind, &t0, &ch) >= 5) {
         Kind k;
-        if (parseKind(kind, &k)) judge_->callStarted(slot, gen, seq, k, s.slot.inst, ch, t0);
+        if (parseKind(kind, &k)) {
+          judge_->callStarted(slot, gen, seq, k, s.slot.inst, ch, t0);
+          s.callKind = k;
+        }
       }
       s.inCall = true;
       return;
@@ -292,8 +306,9 @@ class Run {
     s.proc.kill(SIGKILL);
     s.killed = true;
     judge_->clientGone(s.index, s.gen, s.slot.inst, now, s.inCall);
-    logf(now, "kill client %d.%d (%s %s)%s", s.index, s.gen, instName(s.slot.inst), ifaceName(s.slot.iface),
-         s.inCall ? " in the middle of a call" : "");
+    logf(now, "kill client %d.%d pid %d (%s %s)%s%s", s.index, s.gen, static_cast<int>(s.proc.pid()),
+         instName(s.slot.inst), ifaceName(s.slot.iface), s.inCall ? " in the middle of a call: " : "",
+         s.inCall ? kindName(s.callKind) : "");
     s.killBy = 0;
   }
 
@@ -553,6 +568,13 @@ class Run {
         printf("chaos: VIOLATION seed %llu: the daemon's figures grew beyond the allowance (RSS +%ld kB, fds +%ld, "
                "threads +%ld)\n",
                static_cast<unsigned long long>(o_.seed), kRssAllowanceKb, kFdAllowance, kThreadAllowance);
+        std::string added;
+        for (long tid : sum.end.tids) {
+          if (std::find(sum.start.tids.begin(), sum.start.tids.end(), tid) == sum.start.tids.end()) {
+            added += " " + std::to_string(tid);
+          }
+        }
+        if (!added.empty()) printf("chaos: threads not there at the start (daemon.log's thread ids):%s\n", added.c_str());
         healthy = false;
       }
     }
@@ -602,6 +624,9 @@ class Run {
     endFaultThread();
     if (log_) fclose(log_);
     log_ = nullptr;
+    judge_.reset();
+    if (calls_) fclose(calls_);
+    calls_ = nullptr;
     std::error_code ec;
     if (!root_.empty() && !keep_ && !o_.keep) std::filesystem::remove_all(root_, ec);
   }
@@ -613,6 +638,7 @@ class Run {
   std::string setupError_;
   std::unique_ptr<Properties> props_;
   FILE* log_ = nullptr;
+  FILE* calls_ = nullptr;  // every judged call (calls.log)
   std::mutex logMu_;
   Proc modem_;
   Proc daemon_;

@@ -171,11 +171,17 @@ TEST(ChaosCheck, TheCardsAnswersFollowTheInstance) {
 
 TEST(ChaosCheck, BoundsAddUpTheFaultsAroundACall) {
   BoundConfig c;
-  Fault silence{FaultKind::ModemSilence, 1000, 3500};
+  Fault shortSilence{FaultKind::ModemSilence, 1000, 3500};
+  Fault longSilence{FaultKind::ModemSilence, 1000, 9000};
   Fault bare{FaultKind::ModemBare, 0, 9000};
   EXPECT_EQ(callBoundMs({}, false, c), c.baseMs);
-  EXPECT_EQ(callBoundMs({silence}, false, c), c.baseMs + 2500 + c.hangMs);
-  EXPECT_EQ(callBoundMs({bare}, true, c), c.baseMs + c.otherInstMs);
+  // Waiting behind a silent modem ends at the hang bound; the call in flight
+  // waits the silence out.
+  EXPECT_EQ(callBoundMs({shortSilence}, false, c), c.baseMs + c.hangMs);
+  EXPECT_EQ(callBoundMs({longSilence}, false, c), c.baseMs + 8000);
+  EXPECT_EQ(callBoundMs({shortSilence, longSilence}, false, c), c.baseMs + c.hangMs + 8000);
+  // The other instance's faults cost nothing.
+  EXPECT_EQ(callBoundMs({bare}, true, c), c.baseMs);
 }
 
 }  // namespace
