@@ -105,7 +105,9 @@ AtContext* InitializeAtContext(int32_t fd, int32_t index) {
     pthread_condattr_setclock(&ac->command_cond_attr, CLOCK_MONOTONIC);
     pthread_cond_init(&ac->command_cond, &ac->command_cond_attr);
     pthread_mutex_init(&ac->port_lock, nullptr);
-    pthread_cond_init(&ac->reader_gone_cond, nullptr);
+    // Timed on the monotonic clock as well: a clock step does not stretch
+    // or cut the wait for the reader's end.
+    pthread_cond_init(&ac->reader_gone_cond, &ac->command_cond_attr);
     ac->wake_fd = eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK);
     if (ac->wake_fd < 0) {
       destroyContextSync(ac);
@@ -376,7 +378,7 @@ void at_close(void) {
   // reader itself (closing from its handler) cannot wait for its own end.
   if (t_readerOf != ac) {
     struct timespec deadline;
-    clock_gettime(CLOCK_REALTIME, &deadline);
+    clock_gettime(CLOCK_MONOTONIC, &deadline);
     deadline.tv_sec += kReaderLeaveSeconds;
     MutexGuard g(&ac->port_lock);
     while (ac->reader_running != 0) {
