@@ -227,6 +227,57 @@ Verdict classify(const CallRecord& r, const CallContext& c) {
   return r.iface == Iface::Hidl ? classifyHidl(r, c) : classifyAidl(r, c);
 }
 
+bool faultIsOutage(FaultKind k) {
+  switch (k) {
+    case FaultKind::ModemSlow:
+    case FaultKind::ModemPieces:
+    case FaultKind::ModemUnsol:
+    case FaultKind::ModemBare:
+    case FaultKind::LibSlow:
+      return false;
+    default:
+      return true;
+  }
+}
+
+int64_t uncoveredNs(int64_t start, int64_t end, std::vector<Span> outages) {
+  std::sort(outages.begin(), outages.end(), [](const Span& a, const Span& b) { return a.start < b.start; });
+  int64_t left = 0;
+  int64_t at = start;
+  for (const Span& o : outages) {
+    if (o.end <= at) continue;
+    if (o.start >= end) break;
+    if (o.start > at) left += o.start - at;
+    at = std::max(at, o.end);
+    if (at >= end) return left;
+  }
+  return left + std::max<int64_t>(0, end - at);
+}
+
+int64_t afterUncovered(int64_t from, int64_t needNs, std::vector<Span> outages) {
+  std::sort(outages.begin(), outages.end(), [](const Span& a, const Span& b) { return a.start < b.start; });
+  int64_t at = from;
+  for (const Span& o : outages) {
+    if (o.end <= at) continue;
+    if (o.start >= at + needNs) break;
+    if (o.start > at) needNs -= o.start - at;
+    if (o.end == INT64_MAX) return INT64_MAX;
+    at = o.end;
+  }
+  return at + needNs;
+}
+
+int64_t outageMarginMs(FaultKind k) {
+  switch (k) {
+    case FaultKind::ModemPortLost:
+    case FaultKind::ModemRestart:
+    case FaultKind::CardOut:
+      return kRecoveryMs;
+    default:
+      return 2000;
+  }
+}
+
 int64_t faultTailMs(const BoundConfig& c) { return c.hangMs + 2000; }
 
 int64_t faultAllowanceMs(const Fault& f, const BoundConfig& c) {

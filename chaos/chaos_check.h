@@ -54,6 +54,27 @@ struct CallContext {
 
 Verdict classify(const CallRecord& r, const CallContext& c);
 
+// Service. Some faults the daemon must hide: slow or cut-up answers,
+// unsolicited lines, the bare open form, slow card commands are served as
+// usual ("Failure model"). The others are outages: calls fail cleanly while
+// they last, and the device is served again once they end.
+bool faultIsOutage(FaultKind k);
+// After an outage ends, a call is answered right within this long (the
+// failure model's bound for a port that is back).
+constexpr int64_t kRecoveryMs = 10000;
+struct Span {
+  int64_t start = 0;
+  int64_t end = 0;
+};
+// How much of [start, end] lies outside every span of `outages`.
+int64_t uncoveredNs(int64_t start, int64_t end, std::vector<Span> outages);
+// The time by which `needNs` outside every span of `outages` has passed
+// since `from`: a recovery's clock stops while another outage lasts.
+int64_t afterUncovered(int64_t from, int64_t needNs, std::vector<Span> outages);
+// How long after an outage calls may still fail: a port that is back is
+// opened again within kRecoveryMs; the other outages end at once.
+int64_t outageMarginMs(FaultKind k);
+
 // Latency bounds: those the README's failure model gives, added up for the
 // faults active around the call.
 struct BoundConfig {

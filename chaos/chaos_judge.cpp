@@ -177,6 +177,7 @@ void Judge::judgeUpTo(int64_t horizon) {
   size_t n = 0;
   while (n < queue_.size() && queue_[n].t1 < horizon) judge(queue_[n++]);
   queue_.erase(queue_.begin(), queue_.begin() + static_cast<std::ptrdiff_t>(n));
+  checkService(horizon);
   // No client lives longer than a minute and a half (chaos_client.cpp), so
   // no channel was opened before what settled that long ago.
   const int64_t forget = horizon - 120000 * kMs;
@@ -201,6 +202,90 @@ void Judge::judgeUpTo(int64_t horizon) {
     }
     drops_.swap(kept);
     pruneAt_ = std::max<size_t>(2000, 2 * drops_.size());
+  }
+}
+
+void Judge::serviceViolation(const std::string& what) {
+  if (++reported_ > shown_) return;
+  fprintf(out_, "chaos: VIOLATION seed %llu: %s\n", static_cast<unsigned long long>(seed_), what.c_str());
+  fflush(out_);
+}
+
+void Judge::checkService(int64_t horizon) {
+  const int64_t recovery = kRecoveryMs * kMs;
+  for (FaultSpan& f : faults_) {
+    if (f.serviceChecked || f.end == INT64_MAX) continue;
+    // A recovery may be looked for until well after the fault ended.
+    if (horizon != INT64_MAX && horizon < f.end + 3 * recovery) continue;
+    f.serviceChecked = true;
+    const Inst inst = faultInst(f.fault.kind);
+    // The instance's other outages as they were, and with the time calls
+    // may still fail after them.
+    const std::vector<Served>& served = served_[inst];
+    std::vector<Span> outages, shadows;
+    for (const FaultSpan& o : faults_) {
+      if (&o == &f || faultInst(o.fault.kind) != inst || !faultIsOutage(o.fault.kind)) continue;
+      if (o.end == INT64_MAX) {
+        outages.push_back({o.start, INT64_MAX});
+        shadows.push_back({o.start, INT64_MAX});
+        continue;
+      }
+      outages.push_back({o.start, o.end});
+      // Its shadow lasts until the first call served after it, at most its margin.
+      int64_t back = o.end + outageMarginMs(o.fault.kind) * kMs;
+      for (const Served& c : served) {
+        if (c.t1 >= o.end && c.t1 < back) back = c.t1;
+      }
+      shadows.push_back({o.start, back});
+    }
+    const std::string name = describeFault(f.fault) + " " + at(f.start) + " to " + at(f.end);
+    if (!faultIsOutage(f.fault.kind)) {
+      ++service_.hidden;
+      const int64_t open = uncoveredNs(f.start, f.end, shadows);
+      // Opens under the bare form are what it is about; they are rarer.
+      const bool needOpen = f.fault.kind == FaultKind::ModemBare && open >= 2000 * kMs;
+      if (open < 1000 * kMs) {
+        ++service_.hiddenUnjudged;
+        continue;
+      }
+      bool ok = false;
+      for (const Served& c : served) {
+        if (c.t0 < f.start || c.t1 > f.end || (needOpen && c.kind != Kind::Open)) continue;
+        bool clear = true;
+        for (const Span& o : shadows) clear = clear && (c.t1 < o.start || c.t0 > o.end);
+        if (clear) {
+          ok = true;
+          break;
+        }
+      }
+      if (!ok) {
+        ++service_.unserved;
+        serviceViolation(std::string("no ") + instName(inst) + (needOpen ? " open" : " call") +
+                         " answered right during " + name + ", which the daemon must hide");
+      }
+      continue;
+    }
+    ++service_.outages;
+    const int64_t by = afterUncovered(f.end, recovery, outages);
+    bool ok = false;
+    for (const Served& c : served) ok = ok || (c.t1 >= f.end && c.t1 <= by);
+    if (ok) continue;
+    if (by == INT64_MAX || lastStart_[inst] < by) {
+      ++service_.outagesUnjudged;  // the run ended first
+      continue;
+    }
+    ++service_.late;
+    serviceViolation(std::string("no ") + instName(inst) + " call answered right within " +
+                     std::to_string(kRecoveryMs) + " ms after " + name);
+  }
+  // Nothing checked later looks further back than a fault's length and the
+  // time to recover from it.
+  if (horizon != INT64_MAX) {
+    const int64_t keep = horizon - 90000 * kMs;
+    for (auto& e : served_) {
+      auto& v = e.second;
+      v.erase(v.begin(), std::find_if(v.begin(), v.end(), [&](const Served& c) { return c.t1 >= keep; }));
+    }
   }
 }
 
@@ -276,6 +361,8 @@ void Judge::judge(const CallRecord& r) {
     w.call = describe(r);
   }
 
+  lastStart_[r.inst] = std::max(lastStart_[r.inst], r.t0);
+  if (v.outcome == Outcome::Ok && touchesDevice(r.kind)) served_[r.inst].push_back({r.t0, r.t1, r.kind});
   if (v.outcome == Outcome::Ok && touchesDevice(r.kind)) {
     for (Drop& d : drops_) {
       if (d.inst == r.inst && d.settle == INT64_MAX && d.end < r.t0) d.settle = r.t1;

@@ -21,6 +21,15 @@ struct FaultSpan {
   Fault fault;
   int64_t start = 0;  // monoNanos()
   int64_t end = INT64_MAX;
+  bool serviceChecked = false;
+};
+
+// The service checks (chaos_check.h): faults the daemon must hide, each
+// served while it lasted; outages, each followed by service within
+// kRecoveryMs. Windows too short or too crowded to tell are not judged.
+struct ServiceTally {
+  long hidden = 0, hiddenUnjudged = 0, unserved = 0;
+  long outages = 0, outagesUnjudged = 0, late = 0;
 };
 
 struct Tally {
@@ -57,6 +66,7 @@ class Judge {
 
   const std::map<std::pair<Inst, Iface>, Tally>& tallies() const { return tallies_; }
   long wrong() const { return wrong_; }
+  const ServiceTally& service() const { return service_; }
   long over() const { return over_; }
   long calls() const { return calls_; }
   long callsCut() const { return callsCut_; }
@@ -84,6 +94,9 @@ class Judge {
   };
 
   void judge(const CallRecord& r);
+  // The service checks of the faults that ended long enough before `horizon`.
+  void checkService(int64_t horizon);
+  void serviceViolation(const std::string& what);
   std::vector<FaultSpan> overlapping(Inst inst, int64_t t0, int64_t t1, bool* other) const;
   // The bound of a call on `inst` from t0 to t1, given the faults around it.
   int64_t boundMsFor(Inst inst, int64_t t0, int64_t t1) const;
@@ -107,6 +120,14 @@ class Judge {
   std::map<std::tuple<int, int, long>, size_t> openDrops_;  // init/reset/close calls under way
   std::map<std::pair<int, int>, std::vector<size_t>> dropsOfClient_;
   std::vector<CallRecord> queue_;
+
+  struct Served {
+    int64_t t0, t1;
+    Kind kind;
+  };
+  std::map<Inst, std::vector<Served>> served_;  // calls answered right that reached the device
+  std::map<Inst, int64_t> lastStart_;           // the latest call judged, by its start
+  ServiceTally service_;
 
   std::map<std::pair<Inst, Iface>, Tally> tallies_;
   Worst worst_[kKinds][2];

@@ -35,6 +35,14 @@ void printReport(FILE* out, const Judge& j, const Summary& s) {
   fprintf(out, "\nchaos: faults by kind\n  %-16s %6s %9s\n", "kind", "count", "seconds");
   for (const auto& [k, e] : byKind) fprintf(out, "  %-16s %6ld %9.1f\n", faultName(k), e.first, e.second);
 
+  const ServiceTally& sv = j.service();
+  fprintf(out,
+          "\nchaos: service\n  faults the daemon must hide: %ld, each served while it lasted but %ld (%ld too covered "
+          "by outages to tell)\n  outages: %ld, each followed by service within %lld ms (other outages not "
+          "counted) but %ld (%ld cut by the end)\n",
+          sv.hidden, sv.unserved, sv.hiddenUnjudged, sv.outages, static_cast<long long>(kRecoveryMs), sv.late,
+          sv.outagesUnjudged);
+
   fprintf(out, "\nchaos: worst latency per call kind, ms (bound at that call)\n  %-9s %19s %19s\n", "call",
           "no fault active", "a fault active");
   for (int k = 0; k < kKinds; ++k) {

@@ -184,5 +184,21 @@ TEST(ChaosCheck, BoundsAddUpTheFaultsAroundACall) {
   EXPECT_EQ(callBoundMs({bare}, true, c), c.baseMs);
 }
 
+TEST(ChaosCheck, ServiceIsJudgedOutsideOutages) {
+  EXPECT_FALSE(faultIsOutage(FaultKind::ModemBare));
+  EXPECT_FALSE(faultIsOutage(FaultKind::LibSlow));
+  EXPECT_TRUE(faultIsOutage(FaultKind::ModemSilence));
+  EXPECT_TRUE(faultIsOutage(FaultKind::LibFail));
+  EXPECT_EQ(uncoveredNs(0, 100, {}), 100);
+  // Overlapping and unordered outages, one reaching past the end.
+  EXPECT_EQ(uncoveredNs(0, 100, {{50, 70}, {10, 20}, {15, 30}, {90, 200}}), 10 + 20 + 20);
+  EXPECT_EQ(uncoveredNs(0, 100, {{-10, 150}}), 0);
+  // A recovery's clock stops while another outage lasts.
+  EXPECT_EQ(afterUncovered(0, 100, {}), 100);
+  EXPECT_EQ(afterUncovered(0, 100, {{50, 80}, {60, 90}, {300, 400}}), 140);
+  EXPECT_EQ(afterUncovered(0, 100, {{-5, 20}}), 120);
+  EXPECT_EQ(afterUncovered(0, 100, {{10, INT64_MAX}}), INT64_MAX);
+}
+
 }  // namespace
 }  // namespace chaos
