@@ -280,7 +280,9 @@ int64_t outageMarginMs(FaultKind k) {
 
 int64_t faultTailMs(const BoundConfig& c) { return c.hangMs + 2000; }
 
-int64_t faultAllowanceMs(const Fault& f, const BoundConfig& c) {
+bool faultHoldsCall(FaultKind k) { return k == FaultKind::ModemSilence || k == FaultKind::LibHang; }
+
+int64_t faultAllowanceMs(const Fault& f, const BoundConfig& c, bool inFlight) {
   // A call waits for at most the two callers admitted before it and the
   // closes queued ahead of it, then runs itself: four calls' worth. The
   // longest call on the SIM is an init that closes every channel: 24 AT
@@ -294,7 +296,7 @@ int64_t faultAllowanceMs(const Fault& f, const BoundConfig& c) {
       // The call in flight waits out the silence; those behind it give up
       // once it has gone the hang bound without progress, later ones at once
       // ("Failure model").
-      return std::max(len, c.hangMs);
+      return inFlight ? std::max(len, c.hangMs) : c.hangMs;
     case FaultKind::ModemSlow:
       return kCalls * kCommands * f.a;
     case FaultKind::ModemPieces: {
@@ -318,9 +320,10 @@ int64_t faultAllowanceMs(const Fault& f, const BoundConfig& c) {
   return 0;
 }
 
-int64_t callBoundMs(const std::vector<Fault>& sameInst, bool otherInstFaulty, const BoundConfig& c) {
+int64_t callBoundMs(const std::vector<Fault>& sameInst, bool otherInstFaulty, const BoundConfig& c,
+                    bool inFlight) {
   int64_t b = c.baseMs;
-  for (const Fault& f : sameInst) b += faultAllowanceMs(f, c);
+  for (const Fault& f : sameInst) b += faultAllowanceMs(f, c, inFlight);
   if (otherInstFaulty) b += c.otherInstMs;
   return b;
 }

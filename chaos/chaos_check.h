@@ -88,8 +88,14 @@ struct BoundConfig {
 // behind it and the closes it left finish first.
 int64_t faultTailMs(const BoundConfig& c);
 // What one fault may add to a call on its own instance.
-int64_t faultAllowanceMs(const Fault& f, const BoundConfig& c);
+// `inFlight`: for the call a silence or a hung library caught in the device,
+// which waits the fault out; every other call gives up after the hang bound.
+int64_t faultAllowanceMs(const Fault& f, const BoundConfig& c, bool inFlight = true);
 // The bound for a call given the faults that overlapped it (with their tails).
-int64_t callBoundMs(const std::vector<Fault>& sameInst, bool otherInstFaulty, const BoundConfig& c);
+int64_t callBoundMs(const std::vector<Fault>& sameInst, bool otherInstFaulty, const BoundConfig& c,
+                    bool inFlight = true);
+// Whether a fault holds the device call in flight: then only that call may
+// take longer than a waiter's bound.
+bool faultHoldsCall(FaultKind k);
 
 }  // namespace chaos

@@ -22,6 +22,9 @@ struct FaultSpan {
   int64_t start = 0;  // monoNanos()
   int64_t end = INT64_MAX;
   bool serviceChecked = false;
+  // A silence or a hung library: a call has waited it out as the one in
+  // flight (only one may).
+  bool waitedOut = false;
 };
 
 // The service checks (chaos_check.h): faults the daemon must hide, each
@@ -99,7 +102,7 @@ class Judge {
   void serviceViolation(const std::string& what);
   std::vector<FaultSpan> overlapping(Inst inst, int64_t t0, int64_t t1, bool* other) const;
   // The bound of a call on `inst` from t0 to t1, given the faults around it.
-  int64_t boundMsFor(Inst inst, int64_t t0, int64_t t1) const;
+  int64_t boundMsFor(Inst inst, int64_t t0, int64_t t1, bool inFlight = true) const;
   bool channelCertain(const CallRecord& r) const;
   size_t addDrop(Inst inst, int64_t start, int64_t end, int channel = -1, std::pair<int, int> by = {-1, -1});
   std::string describe(const CallRecord& r) const;

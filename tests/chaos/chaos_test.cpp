@@ -180,6 +180,7 @@ TEST(ChaosCheck, BoundsAddUpTheFaultsAroundACall) {
   EXPECT_EQ(callBoundMs({shortSilence}, false, c), c.baseMs + c.hangMs);
   EXPECT_EQ(callBoundMs({longSilence}, false, c), c.baseMs + 8000);
   EXPECT_EQ(callBoundMs({shortSilence, longSilence}, false, c), c.baseMs + c.hangMs + 8000);
+  EXPECT_EQ(callBoundMs({longSilence}, false, c, false), c.baseMs + c.hangMs);
   // The other instance's faults cost nothing.
   EXPECT_EQ(callBoundMs({bare}, true, c), c.baseMs);
 }
