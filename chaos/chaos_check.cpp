@@ -52,8 +52,9 @@ Verdict checkTransmitAnswer(const CallRecord& r, const CallContext& c) {
     know = false;  // eSE1's basic channel: any client may select there
   }
   if (know && d == want) return ok();
-  if (r.inst == Inst::Ese && c.libFailSw != 0 && d.size() == 2 && d[0] == (c.libFailSw >> 8) &&
-      d[1] == (c.libFailSw & 0xFF)) {
+  // HIDL's eSE1 failure form; over AIDL a failed exchange is an error status.
+  if (r.inst == Inst::Ese && r.iface == Iface::Hidl && c.libFailSw != 0 && d.size() == 2 &&
+      d[0] == (c.libFailSw >> 8) && d[1] == (c.libFailSw & 0xFF)) {
     return clean("the failed exchange's status word");
   }
   if (d.size() < 2) return wrong("response without a status word: " + got(d));

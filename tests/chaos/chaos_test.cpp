@@ -115,8 +115,10 @@ TEST(ChaosCheck, AnswersAreRightCleanFailuresOrWrong) {
   CallContext failing;
   failing.libFail = true;
   failing.libFailSw = 0x6F00;
-  EXPECT_EQ(classify(transmit(Inst::Ese, Iface::Aidl, echo, {0x6F, 0x00}), failing).outcome, Outcome::Clean)
+  EXPECT_EQ(classify(transmit(Inst::Ese, Iface::Hidl, echo, {0x6F, 0x00}), failing).outcome, Outcome::Clean)
       << "the failed exchange's status word";
+  EXPECT_EQ(classify(transmit(Inst::Ese, Iface::Aidl, echo, {0x6F, 0x00}), failing).outcome, Outcome::Wrong)
+      << "AIDL SUCCESS for a failed exchange";
   EXPECT_EQ(classify(transmit(Inst::Ese, Iface::Aidl, echo, {0x6F, 0x00}), certain).outcome, Outcome::Wrong);
 
   auto call = [](Kind k, Inst inst, Iface iface) {
