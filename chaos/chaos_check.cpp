@@ -225,6 +225,18 @@ const char* outcomeName(Outcome o) {
 
 Verdict classify(const CallRecord& r, const CallContext& c) {
   if (!r.error.empty()) return wrong("transport error: " + r.error);
+  if (c.libFailAll && r.inst == Inst::Ese) {
+    // Every exchange of the library failed while the call ran.
+    const bool success = r.iface == Iface::Aidl ? isSuccess(r.status)
+                         : r.kind == Kind::Transmit
+                             ? !(hidlTransmitFailure(r.inst, r.data) ||
+                                 (c.libFailSw != 0 && r.data.size() == 2 && r.data[0] == (c.libFailSw >> 8) &&
+                                  r.data[1] == (c.libFailSw & 0xFF)))
+                             : isSuccess(r.status);
+    if (success && (r.kind == Kind::Transmit || r.kind == Kind::Open || r.kind == Kind::Basic)) {
+      return wrong("served while every exchange of the library failed");
+    }
+  }
   return r.iface == Iface::Hidl ? classifyHidl(r, c) : classifyAidl(r, c);
 }
 

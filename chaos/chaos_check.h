@@ -45,6 +45,9 @@ struct CallContext {
   // changes of its own may have reached this client's callback.
   bool statesShared = false;
   bool libFail = false;  // the eSE library failing exchanges during the call
+  // ... for all of the call: no exchange can have succeeded, so nothing that
+  // needs one may succeed.
+  bool libFailAll = false;
   // ... and the status word it leaves behind (0: none). eSE1 hands a failed
   // exchange's leftover status word on as the answer: a documented failure.
   int libFailSw = 0;

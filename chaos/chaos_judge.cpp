@@ -308,6 +308,7 @@ void Judge::judge(const CallRecord& r) {
     if (s.fault.kind == FaultKind::LibFail) {
       c.libFail = true;
       if (s.fault.a != 0) c.libFailSw = s.fault.a;
+      c.libFailAll = c.libFailAll || (s.start + 100 * kMs <= r.t0 && s.end != INT64_MAX && r.t1 + 100 * kMs <= s.end);
     }
     if (s.fault.kind == FaultKind::CardOut) c.cardOut = true;
   }

@@ -120,6 +120,13 @@ TEST(ChaosCheck, AnswersAreRightCleanFailuresOrWrong) {
   EXPECT_EQ(classify(transmit(Inst::Ese, Iface::Aidl, echo, {0x6F, 0x00}), failing).outcome, Outcome::Wrong)
       << "AIDL SUCCESS for a failed exchange";
   EXPECT_EQ(classify(transmit(Inst::Ese, Iface::Aidl, echo, {0x6F, 0x00}), certain).outcome, Outcome::Wrong);
+  // All of a call inside the failing: nothing may be served, whatever the channel.
+  CallContext allFailing = failing;
+  allFailing.libFailAll = true;
+  allFailing.channelCertain = false;
+  EXPECT_EQ(classify(transmit(Inst::Ese, Iface::Hidl, echo, {0x6F, 0x00}), allFailing).outcome, Outcome::Clean);
+  EXPECT_EQ(classify(transmit(Inst::Ese, Iface::Hidl, echo, {0x90, 0x00}), allFailing).outcome, Outcome::Wrong);
+  EXPECT_EQ(classify(transmit(Inst::Ese, Iface::Aidl, echo, {0x6F, 0x00}), allFailing).outcome, Outcome::Wrong);
 
   auto call = [](Kind k, Inst inst, Iface iface) {
     CallRecord r;
