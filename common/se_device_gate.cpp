@@ -324,6 +324,11 @@ void DeviceGate::forgetChannels() {
   if (!janitorNeededLocked()) janitorCv_.notify_all();
 }
 
+bool DeviceGate::owned(uint8_t channel) const {
+  std::lock_guard<std::mutex> g(queueLock_);
+  return owners_.count(channel) != 0;
+}
+
 bool DeviceGate::heldByAnother(uint8_t channel, pid_t caller) const {
   std::lock_guard<std::mutex> g(queueLock_);
   auto it = owners_.find(channel);

@@ -123,6 +123,9 @@ class DeviceGate {
   void linked(pid_t client);
   // Queues the close of every channel `owner` opened; never waits.
   void clientDied(pid_t owner);
+  // Whether `channel` has an owner: a channel the device dropped (the eSE
+  // library closed) has none, and nothing is owed to it.
+  bool owned(uint8_t channel) const;
   // Whether `channel` belongs to a live client other than `caller`: an
   // init's sweep leaves such a channel alone.
   bool heldByAnother(uint8_t channel, pid_t caller) const;

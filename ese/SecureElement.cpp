@@ -158,11 +158,17 @@ DeviceGate::Outcome outcomeOf(CloseResult r) {
 
 CloseResult closeTracked(uint8_t channel, const char* op);
 
-// A close of `channel` the library could not make now, made again later.
+// A close of `channel` the library could not make now, made again later;
+// none once the library's close has dropped the channel (it has no owner
+// then), which also keeps it from closing a later open's channel.
 void closeLater(uint8_t channel, const char* op) {
-  SecureElement::gate().defer([channel, op] { return outcomeOf(closeTracked(channel, op)); },
-                              std::string(op) + ", close of channel " + std::to_string(channel),
-                              channel);
+  if (!SecureElement::gate().owned(channel)) return;
+  SecureElement::gate().defer(
+      [channel, op] {
+        if (!SecureElement::gate().owned(channel)) return DeviceGate::Outcome::kDone;
+        return outcomeOf(closeTracked(channel, op));
+      },
+      std::string(op) + ", close of channel " + std::to_string(channel), channel);
 }
 
 // Logs the closing and the outcome of a failed logical open's clean-up.
@@ -210,9 +216,11 @@ CloseResult closeTracked(uint8_t channel, const char* op) {
   __android_log_print(ANDROID_LOG_INFO, kTag, "%s enter!", op);
   CloseResult r = CloseResult::kRefused;
   if (channel != 0 && isTracked(channel)) r = manageClose(channel, channel, op);
-  // A close the library could not make stays owed: the flag stays for init's
-  // sweep and the gate makes it again.
-  if (isTracked(channel) && r != CloseResult::kLibraryFailed) {
+  // A close the library could not make stays owed while the channel is
+  // still the card's (it has an owner): the flag stays for init's sweep and
+  // the gate makes it again.
+  const bool owed = r == CloseResult::kLibraryFailed && SecureElement::gate().owned(channel);
+  if (isTracked(channel) && !owed) {
     g_openedChannels[channel].store(0);
     SecureElement::gate().closed(channel);
   }
