@@ -4,6 +4,8 @@
 
 #include <atchannel.h>
 
+#include "session_release.h"
+
 int32_t at_open(int32_t, AtUnsolHandler, int32_t) { abort(); }
 void at_close(void) { abort(); }
 void at_set_on_timeout(AtTimeoutCallback) { abort(); }
@@ -22,3 +24,9 @@ void request_open_logical_channel(void) { abort(); }
 void request_close_logical_channel(void) { abort(); }
 void request_transmit_apdu(void) { abort(); }
 void clear_session_table(int32_t) { abort(); }
+void session_release_later(int32_t, int32_t) { abort(); }
+void session_release_all(int32_t) { abort(); }
+void session_release_pending(int32_t) { abort(); }
+void session_release_forget(int32_t) { abort(); }
+int32_t session_release_count(int32_t) { abort(); }
+int32_t session_release_now(const char*, int32_t) { abort(); }
