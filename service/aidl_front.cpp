@@ -119,6 +119,7 @@ void AidlFront::clientDied(ClientLink* link) {
   uint64_t cookie = 0;
   wp<IBase> who;
   std::unique_ptr<ClientLink> gone;
+  pid_t pid = 0;
   {
     std::lock_guard<std::mutex> g(mLock);
     for (auto it = mLinks.begin(); it != mLinks.end(); ++it) {
@@ -129,6 +130,7 @@ void AidlFront::clientDied(ClientLink* link) {
       mCallbacks.erase(link->pid);
       // The basic channel was that client's; the card forgets it with the
       // element's close that the HIDL front does on a client's death.
+      pid = link->pid;
       pid_t owner = link->pid;
       mBasicOwner.compare_exchange_strong(owner, 0);
       gone = std::move(*it);
@@ -136,7 +138,7 @@ void AidlFront::clientDied(ClientLink* link) {
       break;
     }
   }
-  AIDL_LOGI("%s, client died", mName.c_str());
+  AIDL_LOGI("%s, client %d died", mName.c_str(), static_cast<int>(pid));
   if (recipient != nullptr) recipient->serviceDied(cookie, who);
 }
 
