@@ -225,8 +225,10 @@ void DeviceGate::drainHeld() {
   std::vector<std::pair<uint8_t, pid_t>> vanished;
   {
     std::lock_guard<std::mutex> g(queueLock_);
+    // A linked client's death is told; only the others are looked for (a
+    // system call each, on every call that has the device).
     for (auto it = owners_.begin(); it != owners_.end();) {
-      if (processGone(it->second)) {
+      if (linked_.count(it->second) == 0 && processGone(it->second)) {
         vanished.emplace_back(it->first, it->second);
         it = owners_.erase(it);
       } else {
@@ -272,7 +274,9 @@ bool DeviceGate::janitorHasWork() {
   {
     std::lock_guard<std::mutex> g(queueLock_);
     if (!queue_.empty()) return true;
-    for (const auto& o : owners_) owners.push_back(o.second);
+    for (const auto& o : owners_) {
+      if (linked_.count(o.second) == 0) owners.push_back(o.second);
+    }
   }
   for (pid_t pid : owners) {
     if (processGone(pid)) return true;
