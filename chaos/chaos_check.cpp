@@ -1,6 +1,7 @@
 #include "chaos_check.h"
 
 #include <algorithm>
+#include <cstdio>
 
 #include "card_applets.h"
 #include "virtual_card.h"
@@ -278,6 +279,35 @@ int64_t afterUncovered(int64_t from, int64_t needNs, std::vector<Span> outages) 
     at = o.end;
   }
   return at + needNs;
+}
+
+bool parseGiveUp(const std::string& line, GiveUp* out) {
+  if (line.find(" without progress for ") == std::string::npos ||
+      line.find(": call given up") == std::string::npos) {
+    return false;
+  }
+  // "[main] 12-07 00:22:44.041 pid tid E tag: op, SIM1 without progress ..."
+  int month, day, h, m, sec, ms;
+  if (sscanf(line.c_str(), "%*s %d-%d %d:%d:%d.%d", &month, &day, &h, &m, &sec, &ms) != 6) return false;
+  if (line.find(", SIM1 without progress") != std::string::npos) {
+    out->inst = Inst::Sim;
+  } else if (line.find(", eSE1 without progress") != std::string::npos) {
+    out->inst = Inst::Ese;
+  } else {
+    return false;
+  }
+  out->msOfDay = ((int64_t(h) * 60 + m) * 60 + sec) * 1000 + ms;
+  return true;
+}
+
+bool giveUpExcused(int64_t atNs, int64_t hangMs, const std::vector<Span>& outagesOfInst) {
+  constexpr int64_t kMarginMs = 2000;  // log and fault-switch timing on a loaded machine
+  const int64_t from = atNs - (hangMs + kMarginMs) * 1000000;
+  const int64_t to = atNs + kMarginMs * 1000000;
+  for (const Span& o : outagesOfInst) {
+    if (o.start <= to && o.end >= from) return true;
+  }
+  return false;
 }
 
 int64_t outageMarginMs(FaultKind k) {

@@ -97,6 +97,19 @@ int64_t faultAllowanceMs(const Fault& f, const BoundConfig& c, bool inFlight = t
 // The bound for a call given the faults that overlapped it (with their tails).
 int64_t callBoundMs(const std::vector<Fault>& sameInst, bool otherInstFaulty, const BoundConfig& c,
                     bool inFlight = true);
+// A caller that gave up waiting: the daemon's log line "<op>, <instance>
+// without progress for N ms: call given up", its instance and its time of
+// day (the log's wall clock, ms since midnight).
+struct GiveUp {
+  Inst inst = Inst::Sim;
+  int64_t msOfDay = 0;
+};
+bool parseGiveUp(const std::string& logLine, GiveUp* out);
+// Slow is not broken: a caller may give up only when its device stopped
+// making progress, that is within an outage on its instance that overlaps
+// the hang bound (and a margin) before the give-up.
+bool giveUpExcused(int64_t atNs, int64_t hangMs, const std::vector<Span>& outagesOfInst);
+
 // Whether a fault holds the device call in flight: then only that call may
 // take longer than a waiter's bound.
 bool faultHoldsCall(FaultKind k);

@@ -205,6 +205,32 @@ void Judge::judgeUpTo(int64_t horizon) {
   }
 }
 
+bool Judge::gaveUp(Inst inst, int64_t at, const std::string& logLine) {
+  std::vector<Span> outages;
+  std::string active;
+  {
+    std::lock_guard<std::mutex> l(mu_);
+    for (const FaultSpan& f : faults_) {
+      if (faultInst(f.fault.kind) != inst) continue;
+      if (faultIsOutage(f.fault.kind)) outages.push_back({f.start, f.end});
+      if (f.start <= at && f.end >= at - bounds_.hangMs * kMs) active += " " + describeFault(f.fault);
+    }
+  }
+  if (giveUpExcused(at, bounds_.hangMs, outages)) return false;
+  {
+    std::lock_guard<std::mutex> l(mu_);
+    ++wrong_;
+    if (++reported_ > shown_) return true;
+  }
+  fprintf(out_,
+          "chaos: VIOLATION seed %llu at %s: a caller gave up while its device made progress (no outage of %s)\n"
+          "  daemon: %s\n  faults of %s active: %s\n",
+          static_cast<unsigned long long>(seed_), this->at(at).c_str(), instName(inst), logLine.c_str(),
+          instName(inst), active.empty() ? "none" : active.c_str());
+  fflush(out_);
+  return true;
+}
+
 void Judge::serviceViolation(const std::string& what) {
   if (++reported_ > shown_) return;
   fprintf(out_, "chaos: VIOLATION seed %llu: %s\n", static_cast<unsigned long long>(seed_), what.c_str());

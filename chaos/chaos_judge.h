@@ -64,6 +64,10 @@ class Judge {
   // Judges the calls that ended before `horizon`.
   void judgeUpTo(int64_t horizon);
 
+  // A caller of `inst` gave up waiting at `at` (the daemon's log): wrong
+  // unless an outage of that instance was about then (true: counted wrong).
+  bool gaveUp(Inst inst, int64_t at, const std::string& logLine);
+
   // Every judged call, one line each, in the order judged (nullptr: none).
   void traceTo(FILE* trace) { trace_ = trace; }
 

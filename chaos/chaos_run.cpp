@@ -84,6 +84,7 @@ class Run {
       struct tm tm;
       localtime_r(&wall.tv_sec, &tm);
       logf(origin_, "start: wall clock %02d:%02d:%02d.%03ld", tm.tm_hour, tm.tm_min, tm.tm_sec, wall.tv_nsec / 1000000);
+      originMsOfDay_ = ((int64_t(tm.tm_hour) * 60 + tm.tm_min) * 60 + tm.tm_sec) * 1000 + wall.tv_nsec / 1000000;
     }
     chaosPhase();
     return finish(true);
@@ -557,6 +558,7 @@ class Run {
       usleep(500000);
       sum.end = healthOf(daemon_.pid());
       judge_->judgeUpTo(INT64_MAX);
+      judgeGiveUps();
     }
     sum.leftOpen = open;
     sum.faults = static_cast<long>(judge_->faults().size());
@@ -591,6 +593,26 @@ class Run {
     if (!pass && !g_stop) keep_ = true;
     if (keep_ || o_.keep) printf("chaos: device root kept: %s (chaos.log, daemon.log)\n", root_.c_str());
     return pass ? 0 : 1;
+  }
+
+  // Every caller the daemon let give up, against the faults of its
+  // instance: slow is not broken.
+  void judgeGiveUps() {
+    FILE* f = fopen((root_ + "/daemon.log").c_str(), "r");
+    if (f == nullptr) return;
+    char line[1024];
+    constexpr int64_t kDayMs = 24 * 3600 * 1000;
+    while (fgets(line, sizeof(line), f) != nullptr) {
+      GiveUp g;
+      if (!parseGiveUp(line, &g)) continue;
+      int64_t sinceMs = g.msOfDay - originMsOfDay_;
+      if (sinceMs < -kDayMs / 2) sinceMs += kDayMs;  // the run went past midnight
+      if (sinceMs < 0) continue;                      // before the chaos phase
+      std::string text(line);
+      if (!text.empty() && text.back() == '\n') text.pop_back();
+      judge_->gaveUp(g.inst, origin_ + sinceMs * kMs, text);
+    }
+    fclose(f);
   }
 
   std::string eseReport() const { return root_ + "/data/vendor/ese_sim/open_channels"; }
@@ -652,6 +674,7 @@ class Run {
   std::vector<std::unique_ptr<SlotState>> probes_;
   std::mt19937_64 rng_;
   int64_t origin_ = 0;
+  int64_t originMsOfDay_ = 0;  // the chaos phase's start by the logs' wall clock
   Health start_;
   bool daemonDied_ = false;
   bool keep_ = false;

@@ -210,5 +210,43 @@ TEST(ChaosCheck, ServiceIsJudgedOutsideOutages) {
   EXPECT_EQ(afterUncovered(0, 100, {{10, INT64_MAX}}), INT64_MAX);
 }
 
+TEST(ChaosCheck, AGiveUpIsExcusedOnlyByAnOutageOfItsInstance) {
+  struct Case {
+    const char* line;
+    bool parsed;
+    Inst inst;
+    int64_t msOfDay;
+  } cases[] = {
+      {"[main] 12-07 00:22:44.041 20415 20421 E qvese@1.0-service: transmit, eSE1 without progress for "
+       "3001 ms: call given up",
+       true, Inst::Ese, 1364041},
+      {"[radio] 12-07 23:59:59.999 1 2 E ZerbSimSecureElement: getAtr, SIM1 without progress for 3000 ms: "
+       "call given up",
+       true, Inst::Sim, 86399999},
+      // Refusals and waits are not give-ups.
+      {"[radio] 12-07 00:00:01.000 1 2 E ZerbSimSecureElement: getAtr, SIM1 busy with 3 callers: call refused",
+       false, Inst::Sim, 0},
+      {"[radio] 12-07 00:00:01.000 1 2 D ZerbSimSecureElement: getAtr, SIM1 busy: waiting (2 callers)", false,
+       Inst::Sim, 0},
+      {"no time here, SIM1 without progress for 1 ms: call given up", false, Inst::Sim, 0},
+  };
+  for (const Case& c : cases) {
+    GiveUp g;
+    ASSERT_EQ(parseGiveUp(c.line, &g), c.parsed) << c.line;
+    if (!c.parsed) continue;
+    EXPECT_EQ(g.inst, c.inst) << c.line;
+    EXPECT_EQ(g.msOfDay, c.msOfDay) << c.line;
+  }
+
+  const int64_t s = 1000000000;
+  // A hang bound of 3 s: an outage that ended within the bound and a margin
+  // before the give-up excuses it, one long gone or still to come does not.
+  EXPECT_TRUE(giveUpExcused(20 * s, 3000, {{10 * s, 18 * s}}));
+  EXPECT_TRUE(giveUpExcused(20 * s, 3000, {{19 * s, INT64_MAX}}));
+  EXPECT_FALSE(giveUpExcused(20 * s, 3000, {{1 * s, 14 * s}}));
+  EXPECT_FALSE(giveUpExcused(20 * s, 3000, {{23 * s, 30 * s}}));
+  EXPECT_FALSE(giveUpExcused(20 * s, 3000, {}));
+}
+
 }  // namespace
 }  // namespace chaos
