@@ -122,15 +122,20 @@ Health healthOf(pid_t pid) {
 }
 
 int openChannelsIn(const std::string& path) {
+  std::vector<int> channels;
+  return channelListIn(path, &channels) ? static_cast<int>(channels.size()) : -1;
+}
+
+bool channelListIn(const std::string& path, std::vector<int>* channels) {
+  channels->clear();
   std::ifstream in(path);
-  if (!in) return -1;
+  if (!in) return false;
   std::string line;
   std::getline(in, line);
   std::istringstream words(line);
-  int n = 0;
   std::string w;
-  while (words >> w) ++n;
-  return n;
+  while (words >> w) channels->push_back(atoi(w.c_str()));
+  return true;
 }
 
 bool writeFile(const std::string& path, const std::string& text) {

@@ -60,6 +60,8 @@ Health healthOf(pid_t pid);
 // The channels listed in a simulator's open-channel report (one line of
 // numbers); -1 when it cannot be read.
 int openChannelsIn(const std::string& path);
+// The channel numbers of such a report; false when there is none.
+bool channelListIn(const std::string& path, std::vector<int>* channels);
 
 bool writeFile(const std::string& path, const std::string& text);
 // One line from `fd` within `timeoutMs` ("" on time-out or end).

@@ -6,7 +6,6 @@ namespace chaos {
 
 namespace {
 
-constexpr int64_t kMs = 1000000;
 // A death notice or a queued close may take this long to reach the device
 // after the event that caused it.
 constexpr int64_t kSettleMarginNs = 1000 * kMs;
@@ -63,6 +62,11 @@ std::vector<FaultSpan> Judge::faults() const {
 }
 
 void Judge::callStarted(int slot, int gen, long seq, Kind kind, Inst inst, int channel, int64_t t0) {
+  if (kind == Kind::Open || kind == Kind::Basic) {
+    std::lock_guard<std::mutex> l(mu_);
+    opening_[{slot, gen, seq}] = {inst, t0};
+    return;
+  }
   if (kind != Kind::Init && kind != Kind::Reset && kind != Kind::Close) return;
   std::lock_guard<std::mutex> l(mu_);
   // An init or a reset may close every channel of the instance (an init
@@ -76,6 +80,10 @@ void Judge::callStarted(int slot, int gen, long seq, Kind kind, Inst inst, int c
 
 void Judge::callEnded(const CallRecord& r) {
   std::lock_guard<std::mutex> l(mu_);
+  if (r.kind == Kind::Open || r.kind == Kind::Basic) {
+    opening_.erase({r.slot, r.gen, r.seq});
+    if (r.resultChannel >= 0) lastOpened_[{r.inst, r.resultChannel}] = r.t0;
+  }
   auto it = openDrops_.find({r.slot, r.gen, r.seq});
   if (it != openDrops_.end()) {
     drops_[it->second].end = r.t1;  // what an init, a reset or a close does, it does in the call
@@ -203,6 +211,27 @@ void Judge::judgeUpTo(int64_t horizon) {
     drops_.swap(kept);
     pruneAt_ = std::max<size_t>(2000, 2 * drops_.size());
   }
+}
+
+long Judge::channelsKept(Inst inst, const std::vector<int>& openAtDevice, int64_t since, int64_t now) {
+  std::lock_guard<std::mutex> l(mu_);
+  long unexplained = 0;
+  for (int c : openAtDevice) {
+    auto it = lastOpened_.find({inst, c});
+    if (it == lastOpened_.end() || it->second < since) ++unexplained;
+  }
+  // An open under way may hold a channel its client has not heard of yet;
+  // one whose client was killed stays under way, so only recent ones count.
+  long underWay = 0;
+  for (auto it = opening_.begin(); it != opening_.end();) {
+    if (it->second.second < now - 60000 * kMs) {
+      it = opening_.erase(it);
+      continue;
+    }
+    if (it->second.first == inst) ++underWay;
+    ++it;
+  }
+  return std::max(0L, unexplained - underWay);
 }
 
 bool Judge::gaveUp(Inst inst, int64_t at, const std::string& logLine) {

@@ -64,6 +64,10 @@ class Judge {
   // Judges the calls that ended before `horizon`.
   void judgeUpTo(int64_t horizon);
 
+  // Of the channels open at `inst`'s device, those no client opened since
+  // `since` (beyond the opens still under way at `now`).
+  long channelsKept(Inst inst, const std::vector<int>& openAtDevice, int64_t since, int64_t now);
+
   // A caller of `inst` gave up waiting at `at` (the daemon's log): wrong
   // unless an outage of that instance was about then (true: counted wrong).
   bool gaveUp(Inst inst, int64_t at, const std::string& logLine);
@@ -134,6 +138,8 @@ class Judge {
   };
   std::map<Inst, std::vector<Served>> served_;  // calls answered right that reached the device
   std::map<Inst, int64_t> lastStart_;           // the latest call judged, by its start
+  std::map<std::tuple<int, int, long>, std::pair<Inst, int64_t>> opening_;  // opens under way: their start
+  std::map<std::pair<Inst, int>, int64_t> lastOpened_;  // a channel's last open by a client: its start
   ServiceTally service_;
 
   std::map<std::pair<Inst, Iface>, Tally> tallies_;

@@ -24,6 +24,8 @@ bool fromHex(const std::string& text, std::vector<uint8_t>* out);
 
 // Nanoseconds of CLOCK_MONOTONIC: the same clock in every process of a run.
 int64_t monoNanos();
+// One millisecond in monoNanos().
+constexpr int64_t kMs = 1000000;
 
 struct CallRecord {
   int slot = -1;

@@ -17,7 +17,6 @@ namespace chaos {
 
 namespace {
 
-constexpr int64_t kMs = 1000000;
 
 bool isFinal(const std::string& l) {
   return l == "OK" || l == "ERROR" || l == "NO CARRIER" || l.rfind("+CME ERROR", 0) == 0 ||

@@ -17,6 +17,7 @@
 #include <random>
 #include <thread>
 
+#include "chaos_audit.h"
 #include "chaos_client.h"
 #include "chaos_env.h"
 #include "chaos_judge.h"
@@ -30,7 +31,6 @@ namespace chaos {
 namespace {
 
 std::atomic<bool> g_stop{false};
-constexpr int64_t kMs = 1000000;
 // Calls are judged this long after they ended: every start line of a call
 // that overlapped them has arrived by then.
 constexpr int64_t kJudgeLagNs = 2000 * kMs;
@@ -464,6 +464,7 @@ class Run {
     const int64_t end = origin_ + int64_t(o_.seconds) * 1000 * kMs;
     size_t nextKill = 0;
     int64_t nextNote = origin_ + 30000 * kMs;
+    int64_t nextLossCheck = origin_;
     while (!g_stop) {
       const int64_t now = monoNanos();
       if (now >= end) break;
@@ -478,6 +479,10 @@ class Run {
       }
       pump(5);
       judge_->judgeUpTo(now - kJudgeLagNs);
+      if (now >= nextLossCheck) {
+        portLosses_.check(*judge_, root_ + "/modem-channels", now, [this] { pump(0); });
+        nextLossCheck = now + 500 * kMs;
+      }
       int status = 0;
       if (!daemon_.running(&status)) {
         daemonDied_ = true;
@@ -558,9 +563,9 @@ class Run {
       usleep(500000);
       sum.end = healthOf(daemon_.pid());
       judge_->judgeUpTo(INT64_MAX);
-      judgeGiveUps();
+      judgeGiveUps(*judge_, root_ + "/daemon.log", origin_, originMsOfDay_);
     }
-    sum.leftOpen = open;
+    sum.leftOpen = open + portLosses_.kept();
     sum.faults = static_cast<long>(judge_->faults().size());
     bool healthy = ran && !daemonDied_;
     if (healthy) {
@@ -585,34 +590,16 @@ class Run {
       healthy = false;
     }
     if (g_stop) printf("chaos: interrupted\n");
+    portLosses_.report(stdout);
     printReport(stdout, *judge_, sum);
     // A fault window without a right answer is noted only (see the judge);
     // service that does not come back after an outage fails the run.
     const bool served = judge_->service().late == 0;
-    const bool pass = healthy && served && !g_stop && judge_->wrong() == 0 && judge_->over() == 0 && open == 0;
+    const bool pass = healthy && served && !g_stop && judge_->wrong() == 0 && judge_->over() == 0 &&
+                      sum.leftOpen == 0;
     if (!pass && !g_stop) keep_ = true;
     if (keep_ || o_.keep) printf("chaos: device root kept: %s (chaos.log, daemon.log)\n", root_.c_str());
     return pass ? 0 : 1;
-  }
-
-  // Every caller the daemon let give up, against the faults of its
-  // instance: slow is not broken.
-  void judgeGiveUps() {
-    FILE* f = fopen((root_ + "/daemon.log").c_str(), "r");
-    if (f == nullptr) return;
-    char line[1024];
-    constexpr int64_t kDayMs = 24 * 3600 * 1000;
-    while (fgets(line, sizeof(line), f) != nullptr) {
-      GiveUp g;
-      if (!parseGiveUp(line, &g)) continue;
-      int64_t sinceMs = g.msOfDay - originMsOfDay_;
-      if (sinceMs < -kDayMs / 2) sinceMs += kDayMs;  // the run went past midnight
-      if (sinceMs < 0) continue;                      // before the chaos phase
-      std::string text(line);
-      if (!text.empty() && text.back() == '\n') text.pop_back();
-      judge_->gaveUp(g.inst, origin_ + sinceMs * kMs, text);
-    }
-    fclose(f);
   }
 
   std::string eseReport() const { return root_ + "/data/vendor/ese_sim/open_channels"; }
@@ -674,6 +661,7 @@ class Run {
   std::vector<std::unique_ptr<SlotState>> probes_;
   std::mt19937_64 rng_;
   int64_t origin_ = 0;
+  PortLossCheck portLosses_{o_.seed};
   int64_t originMsOfDay_ = 0;  // the chaos phase's start by the logs' wall clock
   Health start_;
   bool daemonDied_ = false;

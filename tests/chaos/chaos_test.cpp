@@ -8,6 +8,7 @@
 #include "card_applets.h"
 #include "virtual_card.h"
 #include "chaos_check.h"
+#include "chaos_judge.h"
 #include "chaos_plan.h"
 #include "chaos_record.h"
 
@@ -246,6 +247,41 @@ TEST(ChaosCheck, AGiveUpIsExcusedOnlyByAnOutageOfItsInstance) {
   EXPECT_FALSE(giveUpExcused(20 * s, 3000, {{1 * s, 14 * s}}));
   EXPECT_FALSE(giveUpExcused(20 * s, 3000, {{23 * s, 30 * s}}));
   EXPECT_FALSE(giveUpExcused(20 * s, 3000, {}));
+}
+
+TEST(ChaosJudge, ChannelsAtTheDeviceNoClientOpenedSinceAreKept) {
+  const int64_t s = 1000000000;
+  FILE* quiet = fopen("/dev/null", "w");
+  ASSERT_NE(quiet, nullptr);
+  Judge judge(1, BoundConfig{}, false, 0, quiet);
+  auto opened = [&](long seq, int64_t t0, int channel) {
+    judge.callStarted(0, 0, seq, Kind::Open, Inst::Sim, -1, t0);
+    CallRecord r;
+    r.slot = 0;
+    r.seq = seq;
+    r.kind = Kind::Open;
+    r.inst = Inst::Sim;
+    r.t0 = t0;
+    r.t1 = t0 + s / 100;
+    r.status = channel >= 0 ? "SUCCESS" : "FAILED";
+    r.resultChannel = channel;
+    judge.callEnded(r);
+  };
+  opened(1, 1 * s, 1);   // before the loss began at 10 s
+  opened(2, 2 * s, 2);
+  opened(3, 12 * s, 2);  // channel 2 again, after it
+  opened(4, 13 * s, -1);
+  EXPECT_EQ(judge.channelsKept(Inst::Sim, {}, 10 * s, 20 * s), 0);
+  EXPECT_EQ(judge.channelsKept(Inst::Sim, {2}, 10 * s, 20 * s), 0);
+  EXPECT_EQ(judge.channelsKept(Inst::Sim, {1, 2, 5}, 10 * s, 20 * s), 2);
+  // The other instance's opens explain nothing here.
+  EXPECT_EQ(judge.channelsKept(Inst::Ese, {2}, 10 * s, 20 * s), 1);
+  // An open under way may hold a channel its client has not heard of yet,
+  // until it is a minute old.
+  judge.callStarted(0, 0, 5, Kind::Open, Inst::Sim, -1, 19 * s);
+  EXPECT_EQ(judge.channelsKept(Inst::Sim, {1, 2, 5}, 10 * s, 20 * s), 1);
+  EXPECT_EQ(judge.channelsKept(Inst::Sim, {1, 2, 5}, 10 * s, 80 * s), 2);
+  fclose(quiet);
 }
 
 }  // namespace
