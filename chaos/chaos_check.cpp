@@ -300,11 +300,27 @@ bool parseGiveUp(const std::string& line, GiveUp* out) {
   return true;
 }
 
-bool giveUpExcused(int64_t atNs, int64_t hangMs, const std::vector<Span>& outagesOfInst) {
-  constexpr int64_t kMarginMs = 2000;  // log and fault-switch timing on a loaded machine
+bool faultStallsDevice(FaultKind k) {
+  switch (k) {
+    case FaultKind::ModemSilence:
+    case FaultKind::ModemPortLost:
+    case FaultKind::ModemRestart:
+    case FaultKind::LibHang:
+    case FaultKind::CardOut:
+    case FaultKind::OtherReset:
+      return true;
+    default:
+      return false;
+  }
+}
+
+bool giveUpExcused(int64_t atNs, int64_t hangMs, const std::vector<Span>& stallsOfInst) {
+  // The device went the hang bound without progress just before the give-up;
+  // the margin covers the log's and the fault switch's timing.
+  constexpr int64_t kMarginMs = 500;
   const int64_t from = atNs - (hangMs + kMarginMs) * 1000000;
   const int64_t to = atNs + kMarginMs * 1000000;
-  for (const Span& o : outagesOfInst) {
+  for (const Span& o : stallsOfInst) {
     if (o.start <= to && o.end >= from) return true;
   }
   return false;

@@ -105,10 +105,14 @@ struct GiveUp {
   int64_t msOfDay = 0;
 };
 bool parseGiveUp(const std::string& logLine, GiveUp* out);
+// Faults that stop a device call in the middle: a silent, lost or
+// restarting modem, a hung library, a card gone or reset under PC/SC. (A
+// failing library answers at once.)
+bool faultStallsDevice(FaultKind k);
 // Slow is not broken: a caller may give up only when its device stopped
-// making progress, that is within an outage on its instance that overlaps
-// the hang bound (and a margin) before the give-up.
-bool giveUpExcused(int64_t atNs, int64_t hangMs, const std::vector<Span>& outagesOfInst);
+// making progress, that is within a stall of its instance that overlaps the
+// hang bound (and a margin) before the give-up.
+bool giveUpExcused(int64_t atNs, int64_t hangMs, const std::vector<Span>& stallsOfInst);
 
 // Whether a fault holds the device call in flight: then only that call may
 // take longer than a waiter's bound.

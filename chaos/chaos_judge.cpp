@@ -235,24 +235,24 @@ long Judge::channelsKept(Inst inst, const std::vector<int>& openAtDevice, int64_
 }
 
 bool Judge::gaveUp(Inst inst, int64_t at, const std::string& logLine) {
-  std::vector<Span> outages;
+  std::vector<Span> stalls;
   std::string active;
   {
     std::lock_guard<std::mutex> l(mu_);
     for (const FaultSpan& f : faults_) {
       if (faultInst(f.fault.kind) != inst) continue;
-      if (faultIsOutage(f.fault.kind)) outages.push_back({f.start, f.end});
+      if (faultStallsDevice(f.fault.kind)) stalls.push_back({f.start, f.end});
       if (f.start <= at && f.end >= at - bounds_.hangMs * kMs) active += " " + describeFault(f.fault);
     }
   }
-  if (giveUpExcused(at, bounds_.hangMs, outages)) return false;
+  if (giveUpExcused(at, bounds_.hangMs, stalls)) return false;
   {
     std::lock_guard<std::mutex> l(mu_);
     ++wrong_;
     if (++reported_ > shown_) return true;
   }
   fprintf(out_,
-          "chaos: VIOLATION seed %llu at %s: a caller gave up while its device made progress (no outage of %s)\n"
+          "chaos: VIOLATION seed %llu at %s: a caller gave up while its device made progress (no stall of %s)\n"
           "  daemon: %s\n  faults of %s active: %s\n",
           static_cast<unsigned long long>(seed_), this->at(at).c_str(), instName(inst), logLine.c_str(),
           instName(inst), active.empty() ? "none" : active.c_str());

@@ -240,13 +240,20 @@ TEST(ChaosCheck, AGiveUpIsExcusedOnlyByAnOutageOfItsInstance) {
   }
 
   const int64_t s = 1000000000;
-  // A hang bound of 3 s: an outage that ended within the bound and a margin
-  // before the give-up excuses it, one long gone or still to come does not.
+  // A hang bound of 3 s: a stall that ended within the bound (and half a
+  // second) before the give-up excuses it, one long gone or still to come
+  // does not.
   EXPECT_TRUE(giveUpExcused(20 * s, 3000, {{10 * s, 18 * s}}));
   EXPECT_TRUE(giveUpExcused(20 * s, 3000, {{19 * s, INT64_MAX}}));
-  EXPECT_FALSE(giveUpExcused(20 * s, 3000, {{1 * s, 14 * s}}));
-  EXPECT_FALSE(giveUpExcused(20 * s, 3000, {{23 * s, 30 * s}}));
+  EXPECT_FALSE(giveUpExcused(20 * s, 3000, {{1 * s, 16 * s}}));
+  EXPECT_FALSE(giveUpExcused(20 * s, 3000, {{21 * s, 30 * s}}));
   EXPECT_FALSE(giveUpExcused(20 * s, 3000, {}));
+  // A failing library or a slow modem answers: no excuse.
+  EXPECT_TRUE(faultStallsDevice(FaultKind::LibHang));
+  EXPECT_TRUE(faultStallsDevice(FaultKind::ModemPortLost));
+  EXPECT_FALSE(faultStallsDevice(FaultKind::LibFail));
+  EXPECT_FALSE(faultStallsDevice(FaultKind::LibSlow));
+  EXPECT_FALSE(faultStallsDevice(FaultKind::ModemSlow));
 }
 
 TEST(ChaosJudge, ChannelsAtTheDeviceNoClientOpenedSinceAreKept) {
