@@ -1,9 +1,6 @@
 #include "chaos_pcsc.h"
 
 #include <fcntl.h>
-#include <netinet/in.h>
-#include <sys/socket.h>
-#include <sys/un.h>
 #include <unistd.h>
 #include <winscard.h>
 
@@ -13,60 +10,14 @@
 
 #include "chaos_env.h"
 #include "chaos_record.h"
+#include "pcsc_host.h"
 #include "virtual_card.h"
 
 namespace chaos {
 
 namespace {
 
-constexpr int kDefaultVpcdPort = 35963;
-const char* const kPcscdSocket = "/run/pcscd/pcscd.comm";
 const char* const kReader = "Virtual PCD 00 00";
-
-std::string firstOf(const std::vector<std::string>& paths) {
-  for (const std::string& p : paths) {
-    if (access(p.c_str(), R_OK) == 0) return p;
-  }
-  return "";
-}
-std::string pcscdPath() { return firstOf({"/usr/sbin/pcscd", "/sbin/pcscd", "/usr/local/sbin/pcscd"}); }
-std::string vpcdDriver() {
-  return firstOf({"/usr/lib/pcsc/drivers/serial/libifdvpcd.so", "/usr/local/lib/pcsc/drivers/serial/libifdvpcd.so"});
-}
-
-bool pcscdRunning() {
-  const int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
-  if (fd < 0) return false;
-  sockaddr_un addr{};
-  addr.sun_family = AF_UNIX;
-  strncpy(addr.sun_path, kPcscdSocket, sizeof(addr.sun_path) - 1);
-  const bool up = connect(fd, reinterpret_cast<sockaddr*>(&addr), sizeof(addr)) == 0;
-  close(fd);
-  return up;
-}
-
-int bindPort(int port) {
-  const int fd = socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
-  sockaddr_in a{};
-  a.sin_family = AF_INET;
-  a.sin_port = htons(static_cast<uint16_t>(port));
-  a.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
-  socklen_t len = sizeof(a);
-  const bool ok = fd >= 0 && bind(fd, reinterpret_cast<sockaddr*>(&a), sizeof(a)) == 0 &&
-                  getsockname(fd, reinterpret_cast<sockaddr*>(&a), &len) == 0;
-  if (fd >= 0) close(fd);
-  return ok ? ntohs(a.sin_port) : 0;
-}
-
-// vpcd listens on its configured port for its first slot and on the next
-// one for the second: two free ports in a row.
-int freePortPair() {
-  for (int attempt = 0; attempt < 50; ++attempt) {
-    const int port = bindPort(0);
-    if (port > 0 && port < 65535 && bindPort(port + 1)) return port;
-  }
-  return 0;
-}
 
 // Until the reader reports a card (or none), at most `ms`.
 bool waitCard(bool present, int ms) {
@@ -91,7 +42,7 @@ bool waitCard(bool present, int ms) {
 
 struct PcscEnv::Impl {
   std::string binDir, root;
-  int port = kDefaultVpcdPort;
+  int port = pcsc_host::kDefaultVpcdPort;
   Proc pcscd;  // ours, when none ran
   Proc card;
 
@@ -169,16 +120,12 @@ PcscEnv::~PcscEnv() {
   impl_->pcscd.stop();
 }
 
-std::string PcscEnv::unavailable() {
-  if (pcscdPath().empty()) return "pcscd is not installed (Debian: pcscd; scripts/deps.sh installs it)";
-  if (vpcdDriver().empty()) return "the vpcd reader driver is not installed (Debian: vsmartcard-vpcd)";
-  return "";
-}
+std::string PcscEnv::unavailable() { return pcsc_host::unavailable(); }
 
 bool PcscEnv::start(std::string* error) {
-  if (!pcscdRunning()) {
+  if (!pcsc_host::pcscdRunning()) {
     // Our own pcscd in the foreground, with vpcd on ports of its own.
-    impl_->port = freePortPair();
+    impl_->port = pcsc_host::freePortPair();
     if (impl_->port == 0) {
       *error = "no two free TCP ports in a row for vpcd";
       return false;
@@ -186,14 +133,13 @@ bool PcscEnv::start(std::string* error) {
     const std::string conf = impl_->root + "/pcsc/reader.conf.d";
     std::error_code ec;
     std::filesystem::create_directories(conf, ec);
-    writeFile(conf + "/vpcd", "FRIENDLYNAME \"Virtual PCD\"\nDEVICENAME /dev/null:" + std::to_string(impl_->port) +
-                                  "\nLIBPATH " + vpcdDriver() + "\nCHANNELID " + std::to_string(impl_->port) + "\n");
-    if (!impl_->pcscd.start({pcscdPath(), "--foreground", "-c", conf}, {}, -1, impl_->root + "/pcscd.log")) {
+    writeFile(conf + "/vpcd", pcsc_host::readerConf(impl_->port));
+    if (!impl_->pcscd.start({pcsc_host::pcscdPath(), "--foreground", "-c", conf}, {}, -1, impl_->root + "/pcscd.log")) {
       *error = "cannot start pcscd";
       return false;
     }
     const int64_t deadline = monoNanos() + 10000LL * 1000000;
-    while (!pcscdRunning()) {
+    while (!pcsc_host::pcscdRunning()) {
       if (monoNanos() > deadline || !impl_->pcscd.running()) {
         *error = "pcscd did not come up (" + impl_->root + "/pcscd.log)";
         return false;

@@ -2,15 +2,13 @@
 
 #include <gtest/gtest.h>
 
-#include <netinet/in.h>
 #include <signal.h>
-#include <sys/socket.h>
-#include <sys/un.h>
 #include <unistd.h>
 
 #include <chrono>
-#include <cstring>
 #include <filesystem>
+
+#include "pcsc_host.h"
 
 namespace se_test {
 
@@ -21,60 +19,11 @@ namespace {
 
 namespace fs = std::filesystem;
 
-constexpr int kDefaultVpcdPort = 35963;
-const char* const kPcscdSocket = "/run/pcscd/pcscd.comm";
-
-std::string firstOf(const std::vector<std::string>& paths) {
-  for (const std::string& p : paths)
-    if (access(p.c_str(), R_OK) == 0) return p;
-  return "";
-}
-std::string pcscdPath() { return firstOf({"/usr/sbin/pcscd", "/sbin/pcscd", "/usr/local/sbin/pcscd"}); }
-std::string vpcdDriver() {
-  return firstOf({"/usr/lib/pcsc/drivers/serial/libifdvpcd.so", "/usr/local/lib/pcsc/drivers/serial/libifdvpcd.so"});
-}
-
-// A pcscd answers on the machine-wide socket.
-bool pcscdRunning() {
-  const int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
-  if (fd < 0) return false;
-  sockaddr_un addr{};
-  addr.sun_family = AF_UNIX;
-  strncpy(addr.sun_path, kPcscdSocket, sizeof(addr.sun_path) - 1);
-  const bool up = connect(fd, reinterpret_cast<sockaddr*>(&addr), sizeof(addr)) == 0;
-  close(fd);
-  return up;
-}
-
-// `port` bound on the loopback (0: any); the port taken, or 0.
-int bindPort(int port) {
-  const int fd = socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
-  sockaddr_in a{};
-  a.sin_family = AF_INET;
-  a.sin_port = htons(static_cast<uint16_t>(port));
-  a.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
-  socklen_t len = sizeof(a);
-  const bool ok = fd >= 0 && bind(fd, reinterpret_cast<sockaddr*>(&a), sizeof(a)) == 0 &&
-                  getsockname(fd, reinterpret_cast<sockaddr*>(&a), &len) == 0;
-  if (fd >= 0) close(fd);
-  return ok ? ntohs(a.sin_port) : 0;
-}
-
-// Two free ports in a row: vpcd listens on the configured port for its
-// first slot and on the next one for its second.
-int freePortPair() {
-  for (int attempt = 0; attempt < 50; ++attempt) {
-    const int port = bindPort(0);
-    if (port > 0 && port < 65535 && bindPort(port + 1)) return port;
-  }
-  return 0;
-}
-
 // pcscd says it is ready a moment before its socket takes connections, and
 // tells nothing when it does: ask the socket until it answers.
 bool waitSocket(int ms) {
   const auto deadline = std::chrono::steady_clock::now() + std::chrono::milliseconds(ms);
-  while (!pcscdRunning()) {
+  while (!pcsc_host::pcscdRunning()) {
     if (std::chrono::steady_clock::now() > deadline) return false;
     usleep(2000);
   }
@@ -100,29 +49,24 @@ PcscEnv::~PcscEnv() {
   }
 }
 
-std::string PcscEnv::unavailable() {
-  if (pcscdPath().empty()) return "pcscd is not installed (Debian: pcscd; scripts/deps.sh installs it)";
-  if (vpcdDriver().empty()) return "the vpcd reader driver is not installed (Debian: vsmartcard-vpcd)";
-  return "";
-}
+std::string PcscEnv::unavailable() { return pcsc_host::unavailable(); }
 
 void PcscEnv::startOwn() {
-  port_ = freePortPair();
+  port_ = pcsc_host::freePortPair();
   ASSERT_NE(port_, 0) << "no two free TCP ports in a row for vpcd";
   config_ = std::make_unique<TempRoot>();
-  config_->write("reader.conf.d/vpcd", "FRIENDLYNAME \"Virtual PCD\"\nDEVICENAME /dev/null:" + std::to_string(port_) +
-                                           "\nLIBPATH " + vpcdDriver() + "\nCHANNELID " + std::to_string(port_) + "\n");
+  config_->write("reader.conf.d/vpcd", pcsc_host::readerConf(port_));
   restartDaemon();
 }
 
 void PcscEnv::start() {
-  pcscdPath_ = pcscdPath();
-  if (!pcscdRunning()) {
+  pcscdPath_ = pcsc_host::pcscdPath();
+  if (!pcsc_host::pcscdRunning()) {
     startOwn();
     return;
   }
   // Someone else's pcscd: usable when it serves vpcd's reader.
-  port_ = kDefaultVpcdPort;
+  port_ = pcsc_host::kDefaultVpcdPort;
   SCARDCONTEXT ctx;
   ASSERT_EQ(SCardEstablishContext(SCARD_SCOPE_SYSTEM, nullptr, nullptr, &ctx), SCARD_S_SUCCESS);
   const std::vector<std::string> readers = listReaders(ctx);
@@ -130,7 +74,7 @@ void PcscEnv::start() {
   bool found = false;
   for (const std::string& r : readers) found |= r == reader_;
   ASSERT_TRUE(found) << "a pcscd not started by these tests is running without the reader \"" << reader_
-                     << "\" (vsmartcard-vpcd's /etc/reader.conf.d/vpcd, port " << kDefaultVpcdPort
+                     << "\" (vsmartcard-vpcd's /etc/reader.conf.d/vpcd, port " << pcsc_host::kDefaultVpcdPort
                      << "); stop it, or install vsmartcard-vpcd and restart it";
   ASSERT_TRUE(waitCard(false, 0)) << "\"" << reader_ << "\" already holds a card: another virtual card is connected";
 }
