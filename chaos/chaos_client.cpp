@@ -35,7 +35,8 @@ using ::ndk::ScopedAStatus;
 
 // Calls are timed by the soak; the connection itself never gives up first.
 constexpr int kCallTimeoutMs = 600000;
-// How long init's state may come after init returned.
+// How long init's state may come after init returned (not counted in the
+// call's time: a refused init never sends one).
 constexpr int kStateWaitMs = 2000;
 
 class Conn {
@@ -80,6 +81,7 @@ class HidlConn : public Conn {
       case Kind::Init: {
         sp<HidlState> cb = new HidlState();
         auto ret = se_->init(cb);
+        r.t1 = monoNanos();  // the daemon's part ends here; a state may still follow
         fail(ret);
         const int64_t deadline = monoNanos() + int64_t(kStateWaitMs) * 1000000;
         while (ret.isOk() && !cb->state && monoNanos() < deadline) {
@@ -165,6 +167,7 @@ class AidlConn : public Conn {
         if (cb_ == nullptr) cb_ = ::ndk::SharedRefBase::make<AidlState>();
         const size_t before = cb_->states.size();
         takeAidlStatus(se_->init(cb_), r);
+        r.t1 = monoNanos();  // the daemon's part ends here; a state may still follow
         const int64_t deadline = monoNanos() + int64_t(kStateWaitMs) * 1000000;
         while (r.error.empty() && r.status == "SUCCESS" && cb_->states.size() == before && monoNanos() < deadline) {
           if (::android::host::pollIncomingCalls(binder_.get(), 50) < 0) break;
@@ -320,8 +323,9 @@ class Client {
                          std::to_string(r.seq) + " " + kindName(k) + " " + std::to_string(announced) + " " +
                          std::to_string(r.channel));
     r.t0 = monoNanos();
+    r.t1 = 0;
     conn_->call(r);
-    r.t1 = monoNanos();
+    if (r.t1 == 0) r.t1 = monoNanos();
     if (!writeLine(a_.fd, encodeRecord(r))) _exit(3);  // the soak is gone
     return r;
   }
