@@ -131,7 +131,7 @@ void AidlFront::clientDied(ClientLink* link) {
       // The basic channel was that client's; the card forgets it with the
       // element's close that the HIDL front does on a client's death.
       pid = link->pid;
-      pid_t owner = link->pid;
+      pid_t owner = pid;
       mBasicOwner.compare_exchange_strong(owner, 0);
       gone = std::move(*it);
       mLinks.erase(it);
